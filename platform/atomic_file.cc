@@ -1,0 +1,81 @@
+#include "platform/atomic_file.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <random>
+
+#include "platform/output_stream.h"
+
+namespace vtr {
+namespace {
+
+std::string RandomSuffix() {
+  static constexpr char kAlphabet[] = "abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ0123456789";
+  thread_local std::mt19937_64 rng{std::random_device{}()};
+  std::string s(6, 'x');
+  for (char& c : s) c = kAlphabet[rng() % (sizeof kAlphabet - 1)];
+  return s;
+}
+
+}  // namespace
+
+Result<AtomicFile> AtomicFile::Create(const std::string& path, mode_t mode) {
+  const size_t slash = path.rfind('/');
+  const std::string dir = slash == std::string::npos ? "." : (slash == 0 ? "/" : path.substr(0, slash));
+  const std::string name = slash == std::string::npos ? path : path.substr(slash + 1);
+  if (name.empty() || name == "." || name == "..") return Error(EINVAL, path);
+
+  UniqueFd dirFd(::open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!dirFd) return Error::FromErrno(dir);
+
+  for (int attempt = 0; attempt < 100; ++attempt) {
+    std::string temp = "." + name + "." + RandomSuffix();
+    UniqueFd fd(::openat(dirFd.get(), temp.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, mode));
+    if (fd) {
+      // The mode given is meant whatever the umask.
+      if (::fchmod(fd.get(), mode) != 0) {
+        Error e = Error::FromErrno(path);
+        ::unlinkat(dirFd.get(), temp.c_str(), 0);
+        return e;
+      }
+      return AtomicFile(std::move(dirFd), std::move(fd), path, name, std::move(temp));
+    }
+    if (errno != EEXIST) return Error::FromErrno(dir + "/" + temp);
+  }
+  return Error(EEXIST, path);
+}
+
+AtomicFile::AtomicFile(UniqueFd dir, UniqueFd fd, std::string path, std::string name, std::string tempName)
+    : dir_(std::move(dir)), fd_(std::move(fd)), path_(std::move(path)), name_(std::move(name)),
+      tempName_(std::move(tempName)) {}
+
+AtomicFile::AtomicFile(AtomicFile&& other) noexcept
+    : dir_(std::move(other.dir_)), fd_(std::move(other.fd_)), path_(std::move(other.path_)),
+      name_(std::move(other.name_)), tempName_(std::move(other.tempName_)), committed_(other.committed_) {
+  other.committed_ = true;  // the moved-from object owns nothing to clean up
+}
+
+AtomicFile::~AtomicFile() {
+  if (!committed_ && dir_) ::unlinkat(dir_.get(), tempName_.c_str(), 0);
+}
+
+Status AtomicFile::commit() {
+  if (committed_) return Error(EINVAL, path_ + ": already committed");
+  if (::fsync(fd_.get()) != 0) return Error::FromErrno(path_);
+  if (::renameat(dir_.get(), tempName_.c_str(), dir_.get(), name_.c_str()) != 0) return Error::FromErrno(path_);
+  committed_ = true;
+  fd_.reset();
+  if (::fsync(dir_.get()) != 0) return Error::FromErrno(path_);
+  return Status::Ok();
+}
+
+Status WriteFileAtomically(const std::string& path, std::span<const uint8_t> bytes, mode_t mode) {
+  Result<AtomicFile> file = AtomicFile::Create(path, mode);
+  if (!file.ok()) return file.error();
+  if (Status s = WriteFully(file->fd(), bytes.data(), bytes.size()); !s.ok()) return Error(s.error().code(), path);
+  return file->commit();
+}
+
+}  // namespace vtr
