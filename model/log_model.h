@@ -1,0 +1,88 @@
+// VTRLogModel: where every diagnostic of the helper goes. Each message is
+// copied to the system log and, once file logging is on, appended with a UTC
+// time stamp to one log file per start-up day. File logging is switched on
+// once, at start-up, after a sweep of old entries from the log directory.
+//
+// Thread safety: logMessage() may be called from any thread; writing and
+// flushing the file happen under the model's one lock, the system-log copy
+// outside it. The set-up calls (enable..., set...) are made before serving.
+#ifndef VTR_MODEL_LOG_MODEL_H_
+#define VTR_MODEL_LOG_MODEL_H_
+
+#include <cstdio>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <string_view>
+
+#include "platform/clock.h"
+#include "platform/format.h"
+#include "platform/system_log.h"
+
+namespace vtr {
+
+class VTRLogModel {
+ public:
+  // The process-wide model, created once: system log = syslog, real clock.
+  static VTRLogModel& sharedInstance();
+
+  VTRLogModel(std::shared_ptr<SystemLog> systemLog, std::shared_ptr<Clock> clock);
+  VTRLogModel(const VTRLogModel&) = delete;
+  VTRLogModel& operator=(const VTRLogModel&) = delete;
+  // The stream is never closed (it lives as long as the process); a model
+  // made for a test closes nothing either, the test owns the stream.
+  ~VTRLogModel() = default;
+
+  // Formats the message and writes it (see logMessage).
+  template <typename... Args>
+  void logWithFormat(FormatString<std::type_identity_t<Args>...> format, const Args&... args) {
+    logMessage(Format(format, args...));
+  }
+
+  // Appends "<date description> <message>\n" to the log file when file
+  // logging is on (flushed at once), and sends the message alone to the
+  // system log in every case.
+  void logMessage(std::string_view message);
+
+  // Opens path for appending (created if missing, never truncated), creating
+  // its parent directory if needed. Returns false when the parent cannot be
+  // created (the stream is left as it was) or the file cannot be opened (the
+  // stream becomes null).
+  bool enableLogToFile(const std::string& path);
+  bool logToFileEnabled() const;
+
+  // The start-up set-up: creates directory if missing, probes that it is
+  // writable (a file "testWritability.log" holding "a", removed at once),
+  // removes every entry of the directory created more than expireDays days
+  // ago (a directory with its contents), then opens today's file. Returns
+  // false, with file logging left off, when the directory cannot be created
+  // or written.
+  bool enableLogToFilesUnder(const std::string& directory, const std::string& prefix, long expireDays);
+
+  // "<directory>/<prefix>-YYYYMMDD.log" for today's local date; the year is
+  // padded with spaces to four places.
+  std::string fileNameForTodayUnder(const std::string& directory, const std::string& prefix) const;
+
+  FILE* logFP() const;
+  // Plain assignment: the earlier stream is not closed.
+  void setLogFP(FILE* fp);
+
+  // Where the system-log copy goes (syslog by default; standard error with
+  // the daemon's --stderr; a memory log in tests).
+  void setSystemLog(std::shared_ptr<SystemLog> systemLog);
+  std::shared_ptr<SystemLog> systemLog() const;
+  void setClock(std::shared_ptr<Clock> clock);
+
+ private:
+  // The system log alone, as the expiry sweep reports.
+  void systemLogOnly(std::string_view message);
+
+  mutable std::mutex mutex_;  // the one lock: file writes and flushes
+  FILE* logFP_ = nullptr;
+  std::shared_ptr<SystemLog> systemLog_;
+  std::shared_ptr<Clock> clock_;
+};
+
+}  // namespace vtr
+
+#endif  // VTR_MODEL_LOG_MODEL_H_

@@ -1,0 +1,65 @@
+#include "tests/support/test_support.h"
+
+#include <fcntl.h>
+#include <ftw.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <fstream>
+#include <sstream>
+
+#include <gtest/gtest.h>
+
+#include "model/log_model.h"
+
+namespace vtr::testing {
+
+TempDir::TempDir() {
+  const char* base = std::getenv("TMPDIR");
+  std::string pattern = std::string(base && *base ? base : "/tmp") + "/vtr-test-XXXXXX";
+  if (::mkdtemp(pattern.data()) == nullptr) {
+    ADD_FAILURE() << "mkdtemp failed";
+  }
+  path_ = pattern;
+}
+
+TempDir::~TempDir() { RemoveTree(path_); }
+
+void RemoveTree(const std::string& path) {
+  // Make everything writable first so that read-only directories go too.
+  ::nftw(
+      path.c_str(),
+      [](const char* p, const struct stat* st, int type, struct FTW*) {
+        if (type == FTW_D || type == FTW_DNR) ::chmod(p, (st->st_mode & 07777) | 0700);
+        return 0;
+      },
+      64, FTW_PHYS);
+  ::nftw(
+      path.c_str(), [](const char* p, const struct stat*, int, struct FTW*) { return ::remove(p) == 0 ? 0 : 0; }, 64,
+      FTW_PHYS | FTW_DEPTH);
+}
+
+void WriteFile(const std::string& path, const std::string& content) {
+  std::ofstream out(path, std::ios::binary | std::ios::trunc);
+  ASSERT_TRUE(out.good()) << "cannot write " << path;
+  out << content;
+}
+
+std::string ReadFile(const std::string& path) {
+  std::ifstream in(path, std::ios::binary);
+  std::stringstream ss;
+  ss << in.rdbuf();
+  return ss.str();
+}
+
+LogCapture::LogCapture() : log_(std::make_shared<MemorySystemLog>()) {
+  previous_ = VTRLogModel::sharedInstance().systemLog();
+  VTRLogModel::sharedInstance().setSystemLog(log_);
+}
+
+LogCapture::~LogCapture() { VTRLogModel::sharedInstance().setSystemLog(previous_); }
+
+bool IsRoot() { return ::geteuid() == 0; }
+
+}  // namespace vtr::testing

@@ -1,0 +1,61 @@
+// Helpers shared by the tests: temporary directories that clean up after
+// themselves, and a capture of what the helper logs.
+#ifndef VTR_TESTS_SUPPORT_TEST_SUPPORT_H_
+#define VTR_TESTS_SUPPORT_TEST_SUPPORT_H_
+
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "platform/system_log.h"
+
+namespace vtr::testing {
+
+// A fresh directory under $TMPDIR (or /tmp), removed with all its contents
+// (never following symbolic links) when the object goes away.
+class TempDir {
+ public:
+  TempDir();
+  ~TempDir();
+  TempDir(const TempDir&) = delete;
+  TempDir& operator=(const TempDir&) = delete;
+
+  const std::string& path() const { return path_; }
+  // path() + "/" + relative
+  std::string operator/(const std::string& relative) const { return path_ + "/" + relative; }
+
+ private:
+  std::string path_;
+};
+
+// Writes content to path (created or truncated); fails the test on error.
+void WriteFile(const std::string& path, const std::string& content);
+// The whole content of path; empty when unreadable.
+std::string ReadFile(const std::string& path);
+// Removes path and everything below it without following links.
+void RemoveTree(const std::string& path);
+
+// While alive, everything sent to the shared VTRLogModel's system log is kept
+// here instead; the previous system log is put back afterwards.
+class LogCapture {
+ public:
+  LogCapture();
+  ~LogCapture();
+  LogCapture(const LogCapture&) = delete;
+  LogCapture& operator=(const LogCapture&) = delete;
+
+  std::vector<std::string> messages() const { return log_->messages(); }
+  bool contains(const std::string& message) const { return log_->contains(message); }
+  void clear() { log_->clear(); }
+
+ private:
+  std::shared_ptr<MemorySystemLog> log_;
+  std::shared_ptr<SystemLog> previous_;
+};
+
+// True when the tests run as root (ownership and mount tests need it).
+bool IsRoot();
+
+}  // namespace vtr::testing
+
+#endif  // VTR_TESTS_SUPPORT_TEST_SUPPORT_H_
