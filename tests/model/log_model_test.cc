@@ -1,0 +1,190 @@
+#include "model/log_model.h"
+
+#include <fcntl.h>
+#include <linux/fs.h>
+#include <sys/ioctl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <ctime>
+
+#include <gtest/gtest.h>
+
+#include "model/log.h"
+#include "platform/file_dates.h"
+#include "tests/support/test_support.h"
+
+namespace vtr {
+namespace {
+
+using testing::ReadFile;
+using testing::TempDir;
+using testing::WriteFile;
+
+constexpr double kDay = 86400;
+
+bool Exists(const std::string& path) {
+  struct stat st;
+  return ::lstat(path.c_str(), &st) == 0;
+}
+
+// A model with a memory system log and a clock the test sets; the test owns
+// the stream it opens.
+class LogModelTest : public ::testing::Test {
+ protected:
+  LogModelTest()
+      : systemLog_(std::make_shared<MemorySystemLog>()),
+        clock_(std::make_shared<FixedClock>(Date{0})),
+        model_(systemLog_, clock_) {
+    ::setenv("TZ", "UTC", 1);
+    ::tzset();
+  }
+  ~LogModelTest() override {
+    if (model_.logFP() != nullptr) std::fclose(model_.logFP());
+  }
+
+  // Today's log file for the fixed clock.
+  std::string todaysFile() const { return model_.fileNameForTodayUnder(dir_.path(), "vitd_helper"); }
+
+  TempDir dir_;
+  std::shared_ptr<MemorySystemLog> systemLog_;
+  std::shared_ptr<FixedClock> clock_;
+  VTRLogModel model_;
+};
+
+TEST_F(LogModelTest, WithoutFileOnlyTheSystemLogGetsTheBareMessage) {
+  model_.logWithFormat("Couldn't move %@ to %@", std::string("/a"), std::string("/b"));
+  EXPECT_FALSE(model_.logToFileEnabled());
+  EXPECT_EQ(systemLog_->messages(), std::vector<std::string>{"Couldn't move /a to /b"});
+}
+
+TEST_F(LogModelTest, FileLinesCarryTheUtcDateAndKeepATrailingNewline) {
+  clock_->set(Date::FromUnix(1795253400));  // 2026-11-21 09:30:00 UTC
+  ASSERT_TRUE(model_.enableLogToFile(dir_ / "x.log"));
+  model_.logMessage("first");
+  model_.logMessage("ends with newline\n");
+  model_.logMessage("after");
+  EXPECT_EQ(ReadFile(dir_ / "x.log"),
+            "2026-11-21 09:30:00 +0000 first\n"
+            "2026-11-21 09:30:00 +0000 ends with newline\n\n"
+            "2026-11-21 09:30:00 +0000 after\n");
+  // The system log copy has no time stamp.
+  EXPECT_EQ(systemLog_->messages().front(), "first");
+}
+
+TEST_F(LogModelTest, AnExistingFileIsAppendedToNeverTruncated) {
+  clock_->set(Date::FromUnix(1795253400));
+  WriteFile(todaysFile(), "earlier run\n");
+  ASSERT_TRUE(model_.enableLogToFilesUnder(dir_.path(), "vitd_helper", 5));
+  model_.logMessage("restarted");
+  EXPECT_EQ(ReadFile(todaysFile()), "earlier run\n2026-11-21 09:30:00 +0000 restarted\n");
+}
+
+TEST_F(LogModelTest, FileNameOfTheDayPadsTheYearWithSpaces) {
+  clock_->set(Date::FromUnix(UnixFromCivil(CivilTime{2026, 3, 7, 12, 0, 0})));
+  EXPECT_EQ(model_.fileNameForTodayUnder("/private/var/logs/vitd", "vitd_helper"),
+            "/private/var/logs/vitd/vitd_helper-20260307.log");
+  clock_->set(Date::FromUnix(UnixFromCivil(CivilTime{999, 12, 31, 12, 0, 0})));
+  EXPECT_EQ(model_.fileNameForTodayUnder("/d", "p"), "/d/p- 9991231.log");
+}
+
+TEST_F(LogModelTest, ParentDirectoryIsCreatedAndTheProbeNeverStays) {
+  const std::string logs = dir_ / "private/var/logs/vitd";
+  clock_->set(Date::FromUnix(1795253400));
+  ASSERT_TRUE(model_.enableLogToFilesUnder(logs, "vitd_helper", 5));
+  EXPECT_TRUE(model_.logToFileEnabled());
+  EXPECT_FALSE(Exists(logs + "/testWritability.log"));
+  EXPECT_TRUE(Exists(logs + "/vitd_helper-20261121.log"));
+}
+
+TEST_F(LogModelTest, ExpirySweepHonoursTheCutOffToTheSecond) {
+  WriteFile(dir_ / "old.log", "x");
+  ASSERT_EQ(::mkdir((dir_ / "oldsub").c_str(), 0755), 0);
+  WriteFile(dir_ / "oldsub/inner", "x");
+  const Date created = *CreationDateOfItem(dir_ / "oldsub");
+  const Date fileCreated = *CreationDateOfItem(dir_ / "old.log");
+  const Date newest = std::max(created, fileCreated);
+  const Date oldest = std::min(created, fileCreated);
+
+  // 4 days 23 hours after creation: everything stays.
+  clock_->set(Date{oldest.secondsSince2001 + 4 * kDay + 23 * 3600});
+  ASSERT_TRUE(model_.enableLogToFilesUnder(dir_.path(), "vitd_helper", 5));
+  EXPECT_TRUE(Exists(dir_ / "old.log"));
+  EXPECT_TRUE(Exists(dir_ / "oldsub/inner"));
+  std::fclose(model_.logFP());
+  model_.setLogFP(nullptr);
+
+  // 5 days and 1 second after creation: the file goes, and the subdirectory
+  // with its contents. Today's log file, just created, stays.
+  clock_->set(Date{newest.secondsSince2001 + 5 * kDay + 1});
+  ASSERT_TRUE(model_.enableLogToFilesUnder(dir_.path(), "vitd_helper", 5));
+  EXPECT_FALSE(Exists(dir_ / "old.log"));
+  EXPECT_FALSE(Exists(dir_ / "oldsub"));
+  EXPECT_TRUE(Exists(todaysFile()));
+  EXPECT_TRUE(systemLog_->contains(Format("Removing %@ whose creation date is %@.", dir_ / "old.log", fileCreated)));
+  const Date cutoff{clock_->now().secondsSince2001 - 5 * kDay};
+  EXPECT_TRUE(systemLog_->contains(
+      Format("Checking existing log file (full path) %@ against %@", dir_ / "old.log", cutoff)));
+}
+
+TEST_F(LogModelTest, UnwritableDirectoryLeavesFileLoggingOff) {
+  const std::string logs = dir_ / "logs";
+  ASSERT_EQ(::mkdir(logs.c_str(), 0755), 0);
+  // Root writes through permission bits, so an immutable directory stands in.
+  bool madeReadOnly = false;
+  if (testing::IsRoot()) {
+    const int fd = ::open(logs.c_str(), O_RDONLY | O_DIRECTORY);
+    int flags = 0;
+    if (fd >= 0 && ::ioctl(fd, FS_IOC_GETFLAGS, &flags) == 0) {
+      flags |= FS_IMMUTABLE_FL;
+      madeReadOnly = ::ioctl(fd, FS_IOC_SETFLAGS, &flags) == 0;
+    }
+    if (fd >= 0) ::close(fd);
+  } else {
+    madeReadOnly = ::chmod(logs.c_str(), 0555) == 0;
+  }
+  if (!madeReadOnly) GTEST_SKIP() << "cannot make a directory unwritable on this file system";
+
+  const bool enabled = model_.enableLogToFilesUnder(logs, "vitd_helper", 5);
+  model_.logMessage("still reaches the system log");
+
+  if (testing::IsRoot()) {
+    const int fd = ::open(logs.c_str(), O_RDONLY | O_DIRECTORY);
+    int flags = 0;
+    ::ioctl(fd, FS_IOC_GETFLAGS, &flags);
+    flags &= ~FS_IMMUTABLE_FL;
+    ::ioctl(fd, FS_IOC_SETFLAGS, &flags);
+    ::close(fd);
+  }
+  EXPECT_FALSE(enabled);
+  EXPECT_FALSE(model_.logToFileEnabled());
+  EXPECT_TRUE(systemLog_->contains("still reaches the system log"));
+}
+
+TEST_F(LogModelTest, UncreatableDirectoryFailsWithoutTouchingTheStream) {
+  WriteFile(dir_ / "file", "x");
+  EXPECT_FALSE(model_.enableLogToFilesUnder(dir_ / "file/logs", "vitd_helper", 5));
+  EXPECT_FALSE(model_.enableLogToFile(dir_ / "file/logs/x.log"));
+  EXPECT_EQ(model_.logFP(), nullptr);
+}
+
+TEST(CreationDateTest, BirthTimeWhereRecordedElseModificationTime) {
+  struct statx stx = {};
+  stx.stx_mtime.tv_sec = 2000000000;
+  stx.stx_btime.tv_sec = 1000000000;
+  stx.stx_mask = STATX_MTIME;
+  EXPECT_EQ(CreationDateFromStatx(stx), Date::FromUnix(2000000000));
+  stx.stx_mask = STATX_MTIME | STATX_BTIME;
+  EXPECT_EQ(CreationDateFromStatx(stx), Date::FromUnix(1000000000));
+}
+
+TEST(LogFunctionTest, DebugLogEmitsNothing) {
+  testing::LogCapture capture;
+  VTRDebugLog("Checking the type");
+  VTRLog("It reached %s", "the system log");
+  EXPECT_EQ(capture.messages(), std::vector<std::string>{"It reached the system log"});
+}
+
+}  // namespace
+}  // namespace vtr
