@@ -1,0 +1,105 @@
+// vitdctl: the reference client of the demo-mode helper.
+#include <getopt.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <cstdlib>
+#include <string>
+#include <vector>
+
+#include "tools/vitdctl/request.h"
+#include "tools/vitdctl/session.h"
+
+namespace {
+
+using namespace vtr::vitdctl;
+
+constexpr char kDefaultSocket[] = "/run/com.orvane.vitrelldhelper.sock";
+
+void PrintUsage(FILE* out) {
+  std::fprintf(out,
+               "Usage: vitdctl [--root DIR | --socket PATH] [--timeout S] COMMAND [ARGS...]\n"
+               "\n"
+               "Sends a request to the demo-mode helper and prints each message it sends\n"
+               "back as one line of JSON ({\"Response\":true}, {\"Progress\":42}, {\"Data\":\"...\"}).\n"
+               "On a terminal, progress is drawn as a bar.\n"
+               "\n"
+               "Commands:\n"
+               "  send FILE|-%*s a request dictionary from FILE (XML or binary property list,\n"
+               "  %*s JSON when FILE ends in .json or starts with '{')\n",
+               26, "", 36, "");
+  for (const SubCommand& c : SubCommands()) {
+    const std::string head = std::string(c.name) + (*c.usage ? " " : "") + c.usage;
+    std::fprintf(out, "  %-36s %s\n", head.c_str(), c.summary);
+  }
+  std::fprintf(out,
+               "\n"
+               "Options:\n"
+               "  --root DIR     talk to a helper running with --root DIR\n"
+               "  --socket PATH  the helper's socket (default %s)\n"
+               "  --timeout S    seconds to wait for the next message (default 60)\n"
+               "  --help         show this text\n"
+               "\n"
+               "Exit status: 0 every response true, 1 a response false, 2 no complete answer\n"
+               "(timeout or connection closed), 3 cannot connect, 64 usage error.\n",
+               kDefaultSocket);
+}
+
+[[noreturn]] void UsageError(const std::string& message) {
+  std::fprintf(stderr, "vitdctl: %s\n", message.c_str());
+  std::fprintf(stderr, "Try 'vitdctl --help'.\n");
+  std::exit(kUsage);
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  static const struct option kLongOptions[] = {
+      {"root", required_argument, nullptr, 'r'},     {"socket", required_argument, nullptr, 's'},
+      {"timeout", required_argument, nullptr, 't'},  {"help", no_argument, nullptr, 'h'},
+      {nullptr, 0, nullptr, 0},
+  };
+  SessionOptions options;
+  options.socketPath = kDefaultSocket;
+  std::string root, socket;
+  int c;
+  // "+": options end at the command, so command arguments may start with '-'.
+  while ((c = getopt_long(argc, argv, "+", kLongOptions, nullptr)) != -1) {
+    switch (c) {
+      case 'r': root = optarg; break;
+      case 's': socket = optarg; break;
+      case 't': {
+        char* end = nullptr;
+        const double seconds = std::strtod(optarg, &end);
+        if (end == optarg || *end != '\0' || !(seconds > 0) || seconds > 86400 * 365) {
+          UsageError("--timeout takes a positive number of seconds");
+        }
+        options.timeout = std::chrono::milliseconds(static_cast<int64_t>(seconds * 1000));
+        break;
+      }
+      case 'h': PrintUsage(stdout); return 0;
+      default: UsageError("unknown option");
+    }
+  }
+  if (!root.empty() && !socket.empty()) UsageError("--root and --socket exclude each other");
+  if (!root.empty()) options.socketPath = root + kDefaultSocket;
+  if (!socket.empty()) options.socketPath = socket;
+  if (optind >= argc) UsageError("no command given");
+
+  const std::string command = argv[optind];
+  const std::vector<std::string> args(argv + optind + 1, argv + argc);
+  vtr::Result<vtr::XpcObject> request = vtr::Error::Invalid("");
+  if (command == "send") {
+    if (args.size() != 1) UsageError("send takes one FILE (or - for standard input)");
+    request = ReadRequestFile(args[0]);
+    if (!request.ok()) UsageError("cannot read the request: " + request.error().description());
+  } else if (const SubCommand* sub = FindSubCommand(command)) {
+    vtr::Result<vtr::XpcObject> parameter = sub->parameter(args);
+    if (!parameter.ok()) UsageError(command + " " + parameter.error().description());
+    request = RequestFor(*sub, std::move(parameter).value());
+  } else {
+    UsageError("unknown command '" + command + "'");
+  }
+  options.progressBar = ::isatty(STDOUT_FILENO) == 1;
+  return RunSession(options, *request, stdout);
+}

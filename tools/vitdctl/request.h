@@ -1,0 +1,48 @@
+// Requests for the helper: read from a file (XML or binary property list, or
+// JSON) or made by a sub-command, as the message object that is sent.
+#ifndef VTR_TOOLS_VITDCTL_REQUEST_H_
+#define VTR_TOOLS_VITDCTL_REQUEST_H_
+
+#include <string>
+#include <vector>
+
+#include "platform/result.h"
+#include "platform/value.h"
+#include "xpc/xpc_object.h"
+
+namespace vtr::vitdctl {
+
+// The request dictionary in the file at path ("-" for standard input). JSON
+// when the name ends in ".json" or the text starts with "{" (after white
+// space); a property list otherwise. The top level must be a dictionary.
+Result<XpcObject> ReadRequestFile(const std::string& path);
+
+// The request dictionary of JSON text: objects become dictionaries, integers
+// int64 (uint64 above INT64_MAX), other numbers doubles.
+Result<XpcObject> RequestFromJson(const std::string& text);
+
+// A property-list value as a message object (dates become nanoseconds since
+// 1970, unsigned integers uint64, reals doubles, nil null).
+XpcObject XpcObjectFromValue(const Value& value);
+
+// One sub-command: the request key it sends and how its arguments become
+// the key's value.
+struct SubCommand {
+  const char* name;      // as typed: "prepareWorkContainer"
+  const char* usage;     // arguments, e.g. "PATH"
+  const char* summary;   // one line for --help
+  // The request's value from the arguments after the name, or an Error
+  // describing the misuse.
+  Result<XpcObject> (*parameter)(const std::vector<std::string>& args);
+};
+
+// Every sub-command, in the order --help lists them.
+const std::vector<SubCommand>& SubCommands();
+const SubCommand* FindSubCommand(const std::string& name);
+
+// {"<name>:": parameter}
+XpcObject RequestFor(const SubCommand& command, XpcObject parameter);
+
+}  // namespace vtr::vitdctl
+
+#endif  // VTR_TOOLS_VITDCTL_REQUEST_H_

@@ -1,0 +1,120 @@
+#include "tools/vitdctl/session.h"
+
+#include <nlohmann/json.hpp>
+
+#include <cerrno>
+
+#include "xpc/client.h"
+
+namespace vtr::vitdctl {
+namespace {
+
+using Json = nlohmann::json;
+
+std::string Base64(const XpcBytes& bytes) {
+  static constexpr char kAlphabet[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
+  std::string out;
+  size_t i = 0;
+  for (; i + 2 < bytes.size(); i += 3) {
+    const uint32_t n = (bytes[i] << 16) | (bytes[i + 1] << 8) | bytes[i + 2];
+    out += {kAlphabet[n >> 18], kAlphabet[(n >> 12) & 63], kAlphabet[(n >> 6) & 63], kAlphabet[n & 63]};
+  }
+  if (i + 1 == bytes.size()) {
+    const uint32_t n = bytes[i] << 16;
+    out += {kAlphabet[n >> 18], kAlphabet[(n >> 12) & 63], '=', '='};
+  } else if (i + 2 == bytes.size()) {
+    const uint32_t n = (bytes[i] << 16) | (bytes[i + 1] << 8);
+    out += {kAlphabet[n >> 18], kAlphabet[(n >> 12) & 63], kAlphabet[(n >> 6) & 63], '='};
+  }
+  return out;
+}
+
+Json ToJson(const XpcObject& object) {
+  switch (object.type()) {
+    case XpcObject::Type::kNull: return nullptr;
+    case XpcObject::Type::kBool: return *object.boolValue();
+    case XpcObject::Type::kInt64: return *object.int64Value();
+    case XpcObject::Type::kUint64: return *object.uint64Value();
+    case XpcObject::Type::kDouble: return *object.doubleValue();
+    case XpcObject::Type::kDate: return *object.dateValue();
+    case XpcObject::Type::kData: return Base64(*object.data());
+    case XpcObject::Type::kString: return *object.string();
+    case XpcObject::Type::kUuid: {
+      const XpcUuid uuid = *object.uuidValue();
+      return Base64(XpcBytes(uuid.begin(), uuid.end()));
+    }
+    case XpcObject::Type::kArray: {
+      Json array = Json::array();
+      for (const XpcObject& item : *object.array()) array.push_back(ToJson(item));
+      return array;
+    }
+    case XpcObject::Type::kDictionary: {
+      Json dict = Json::object();
+      for (const auto& [key, item] : *object.dictionary()) dict[key] = ToJson(item);
+      return dict;
+    }
+  }
+  return nullptr;
+}
+
+void DrawProgress(FILE* out, int64_t percent) {
+  constexpr int kWidth = 40;
+  const int64_t shown = percent < 0 ? 0 : (percent > 100 ? 100 : percent);
+  const int filled = static_cast<int>(shown * kWidth / 100);
+  std::fprintf(out, "\r[%s%s] %3lld%%", std::string(filled, '#').c_str(), std::string(kWidth - filled, '-').c_str(),
+               static_cast<long long>(percent));
+  std::fflush(out);
+}
+
+}  // namespace
+
+std::string MessageAsJson(const XpcObject& message) {
+  return ToJson(message).dump(-1, ' ', false, Json::error_handler_t::replace);
+}
+
+int RunSession(const SessionOptions& options, const XpcObject& request, FILE* out) {
+  Result<XpcClient> client = XpcClient::Connect(options.socketPath);
+  if (!client.ok()) {
+    std::fprintf(stderr, "vitdctl: cannot connect to %s: %s\n", options.socketPath.c_str(),
+                 client.error().description().c_str());
+    return kCannotConnect;
+  }
+  if (Status sent = client->send(request); !sent.ok()) {
+    std::fprintf(stderr, "vitdctl: cannot send the request: %s\n", sent.error().description().c_str());
+    return kCannotConnect;
+  }
+
+  const size_t expected = request.dictionary() ? request.dictionary()->size() : 0;
+  size_t responses = 0;
+  bool allTrue = true;
+  bool barShown = false;
+  while (responses < expected) {
+    Result<XpcObject> message = client->receive(options.timeout);
+    if (!message.ok()) {
+      if (barShown) std::fputc('\n', out);
+      const bool timedOut = message.error().code() == ETIMEDOUT;
+      std::fprintf(stderr, "vitdctl: %s after %zu of %zu responses\n",
+                   timedOut ? "no answer in time" : "the helper closed the connection", responses, expected);
+      return kIncomplete;
+    }
+    const XpcObject* progress = message->find("Progress");
+    if (options.progressBar && progress != nullptr && progress->int64Value()) {
+      DrawProgress(out, *progress->int64Value());
+      barShown = true;
+      continue;
+    }
+    if (barShown) {
+      std::fputc('\n', out);
+      barShown = false;
+    }
+    std::fprintf(out, "%s\n", MessageAsJson(*message).c_str());
+    std::fflush(out);
+    if (const XpcObject* response = message->find("Response")) {
+      ++responses;
+      if (response->boolValue() != true) allTrue = false;
+    }
+  }
+  return allTrue ? kAllTrue : kSomeFalse;
+}
+
+}  // namespace vtr::vitdctl

@@ -1,0 +1,42 @@
+// One exchange with the helper: send a request, print every message that
+// comes back, and tell how it went.
+#ifndef VTR_TOOLS_VITDCTL_SESSION_H_
+#define VTR_TOOLS_VITDCTL_SESSION_H_
+
+#include <chrono>
+#include <cstdio>
+#include <string>
+
+#include "xpc/xpc_object.h"
+
+namespace vtr::vitdctl {
+
+// Exit statuses of vitdctl.
+enum ExitStatus : int {
+  kAllTrue = 0,         // every "Response" was true
+  kSomeFalse = 1,       // at least one "Response" was false
+  kIncomplete = 2,      // timeout or closed connection before every response came
+  kCannotConnect = 3,   // nothing listens at the socket
+  kUsage = 64,          // bad command line or request file
+};
+
+struct SessionOptions {
+  std::string socketPath;
+  // How long to wait for the next message (each message restarts the wait).
+  std::chrono::milliseconds timeout{60000};
+  // Draw "Progress" as a bar on this terminal instead of printing JSON lines.
+  bool progressBar = false;
+};
+
+// Sends request and prints each message received as one line of JSON to out
+// ({"Response":true}, {"Progress":42}, {"Data":"<base64>"}), until one
+// "Response" per key of the request has come, the helper closes the
+// connection, or the timeout passes. Diagnostics go to standard error.
+int RunSession(const SessionOptions& options, const XpcObject& request, FILE* out);
+
+// One line of JSON for a message the helper sent.
+std::string MessageAsJson(const XpcObject& message);
+
+}  // namespace vtr::vitdctl
+
+#endif  // VTR_TOOLS_VITDCTL_SESSION_H_

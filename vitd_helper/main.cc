@@ -1,0 +1,94 @@
+// vitd_helper: the demo-mode privileged helper daemon.
+#include <getopt.h>
+
+#include <cstdio>
+#include <cstring>
+#include <string>
+
+#include "model/log.h"
+#include "model/progress_updater.h"
+#include "vitd_helper/message_responder.h"
+#include "vitd_helper/sandbox.h"
+#include "vitd_helper/service.h"
+#include "xpc/peer_identity.h"
+
+namespace {
+
+constexpr char kUsage[] =
+    "Usage: vitd_helper [--root DIR] [--stderr]\n"
+    "\n"
+    "The demo-mode privileged helper. Serves the demo-mode daemon on the Unix\n"
+    "socket /run/com.orvane.vitrelldhelper.sock (or the socket systemd passes),\n"
+    "and only clients whose executable carries its entitlement.\n"
+    "\n"
+    "  --root DIR   confine the helper to DIR (chroot): the socket, the log files\n"
+    "               and every path a client sends resolve inside DIR; the\n"
+    "               accounts come from DIR/etc/passwd and DIR/etc/group\n"
+    "  --stderr     send the system-log copy of each message to standard error\n"
+    "               instead of syslog\n"
+    "  --help       show this text\n";
+
+struct Options {
+  std::string root;
+  bool toStderr = false;
+};
+
+// Parses the command line; exits on --help and on a usage error.
+Options ParseOptions(int argc, char** argv) {
+  static const struct option kLongOptions[] = {
+      {"root", required_argument, nullptr, 'r'},
+      {"stderr", no_argument, nullptr, 's'},
+      {"help", no_argument, nullptr, 'h'},
+      {nullptr, 0, nullptr, 0},
+  };
+  Options options;
+  int c;
+  while ((c = getopt_long(argc, argv, "", kLongOptions, nullptr)) != -1) {
+    switch (c) {
+      case 'r':
+        options.root = optarg;
+        break;
+      case 's':
+        options.toStderr = true;
+        break;
+      case 'h':
+        std::fputs(kUsage, stdout);
+        std::exit(0);
+      default:
+        std::fputs(kUsage, stderr);
+        std::exit(2);
+    }
+  }
+  if (optind != argc) {
+    std::fputs(kUsage, stderr);
+    std::exit(2);
+  }
+  return options;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  using namespace vtr;
+  const Options options = ParseOptions(argc, argv);
+
+  // The system log is opened before any chroot, so that it keeps working.
+  VTRLogModel& logModel = VTRLogModel::sharedInstance();
+  if (options.toStderr) logModel.setSystemLog(MakeStderrLog());
+
+  Result<UniqueFd> proc = options.root.empty() ? OpenProcDirectory("/proc") : EnterSandboxRoot(options.root);
+  if (!proc.ok()) {
+    std::fprintf(stderr, "vitd_helper: cannot set up %s: %s\n", options.root.empty() ? "/proc" : options.root.c_str(),
+                 proc.error().description().c_str());
+    return 1;
+  }
+
+  VTRLog("%s started", argv[0]);
+  (void)logModel.enableLogToFilesUnder("/private/var/logs/vitd", "vitd_helper", 5);
+
+  VTRProgressUpdater::sharedInstance().setSender(
+      [](int64_t percent) { VTRHMessageResponder::sharedInstance().sendProgress(percent); });
+
+  CreateXPCListener(std::move(proc).value());
+  RunService();
+}

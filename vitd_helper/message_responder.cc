@@ -1,0 +1,80 @@
+#include "vitd_helper/message_responder.h"
+
+#include "model/log.h"
+#include "model/xpc_dict_conv.h"
+#include "vitd_helper/command_table.h"
+#include "xpc/sec_task.h"
+
+namespace vtr {
+namespace {
+
+constexpr char kEntitlement[] = "com.orvane.private.vitrell.vitrelld";
+constexpr char kHasEntitlementMethod[] = "-[VTRHMessageResponder hasEntitlementVitrelld]";
+constexpr char kResponderClass[] = "VTRHMessageResponder";
+
+}  // namespace
+
+VTRHMessageResponder& VTRHMessageResponder::sharedInstance() {
+  static VTRHMessageResponder* const instance = new VTRHMessageResponder();
+  return *instance;
+}
+
+bool VTRHMessageResponder::hasEntitlementVitrelld() {
+  std::shared_ptr<Connection> current = connection();
+  Result<SecTask> task = current ? SecTask::CreateWithPeer(current->peer()) : Result<SecTask>(Error(ESRCH, ""));
+  if (!task.ok()) {
+    VTRLog("%s: Cannot create SecTask from audit token", kHasEntitlementMethod);
+    return false;
+  }
+  const Value value = task->copyValueForEntitlement(kEntitlement);
+  if (value.isNil()) {
+    VTRLog("%s: No data received.", kHasEntitlementMethod);
+    return false;
+  }
+  std::optional<bool> granted = value.boolean();
+  if (!granted) {
+    VTRLog("%s: format not correct: %@", kHasEntitlementMethod, value);
+    return false;
+  }
+  return *granted;
+}
+
+void VTRHMessageResponder::handleXPCMessage(const XpcObject& request) {
+  if (!hasEntitlementVitrelld()) {
+    VTRLog("The client does not have proper entitlement");
+    return;
+  }
+  const Value converted = XPCDictionaryConversion::dictionaryWithXPCDictionary(request);
+  const Dictionary* commands = converted.dictionary();
+  if (commands == nullptr) return;
+  for (const auto& [key, parameter] : *commands) {
+    // An empty key names no method at all.
+    if (key.empty()) {
+      VTRLog("selector is nil for %@", key);
+      return;
+    }
+    const Command* command = FindCommand(key);
+    if (command == nullptr) {
+      VTRLog("%@ does not respond to %@.", kResponderClass, key);
+      return;
+    }
+    if ((this->*command->method)(parameter)) {
+      sendPassResponse();
+    } else {
+      sendFailResponse();
+    }
+  }
+}
+
+void VTRHMessageResponder::send(const char* key, XpcObject value) {
+  std::shared_ptr<Connection> current = connection();
+  if (!current) return;  // the client is gone: the message is dropped
+  (void)current->send(XpcObject::Dictionary({{key, std::move(value)}}));
+}
+
+void VTRHMessageResponder::sendPassResponse() { send("Response", XpcObject::Bool(true)); }
+void VTRHMessageResponder::sendFailResponse() { send("Response", XpcObject::Bool(false)); }
+void VTRHMessageResponder::sendProgress(int64_t percent) { send("Progress", XpcObject::Int64(percent)); }
+void VTRHMessageResponder::sendData(const Bytes& bytes) { send("Data", XpcObject::Data(bytes)); }
+
+}  // namespace vtr

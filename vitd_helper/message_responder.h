@@ -1,0 +1,67 @@
+// VTRHMessageResponder: turns a client's request into privileged work.
+//
+// For each request the listener hands over, the responder checks that the
+// sending process holds the helper's entitlement, converts the request to a
+// Value dictionary and treats every key as the name of one of its commands,
+// invoked with that key's value; each command's result becomes a "Response"
+// message (true or false). Keys are walked in the converted dictionary's
+// (sorted) order; a key that names no command ends the walk without a reply
+// for it or any later key. The responder also sends progress reports for
+// long commands, always on the connection that delivered the latest request.
+//
+// Threads: used only from the listener's loop thread, one request at a time.
+#ifndef VTR_VITD_HELPER_MESSAGE_RESPONDER_H_
+#define VTR_VITD_HELPER_MESSAGE_RESPONDER_H_
+
+#include <cstdint>
+#include <memory>
+#include <string>
+
+#include "platform/value.h"
+#include "xpc/connection.h"
+#include "xpc/xpc_object.h"
+
+namespace vtr {
+
+class VTRHMessageResponder {
+ public:
+  static VTRHMessageResponder& sharedInstance();
+
+  // The connection of the latest request; null once that client is gone.
+  // The responder never keeps a connection alive (the reference is weak).
+  std::shared_ptr<Connection> connection() const { return connection_.lock(); }
+  void setConnection(std::weak_ptr<Connection> connection) { connection_ = std::move(connection); }
+
+  // True when the process behind the current connection holds the entitlement
+  // "com.orvane.private.vitrell.vitrelld" with the boolean value true.
+  // Otherwise false after one log line saying why.
+  bool hasEntitlementVitrelld();
+
+  // Handles one request dictionary (see above). Sends nothing to a client
+  // without the entitlement.
+  void handleXPCMessage(const XpcObject& request);
+
+  // The four messages, sent on the current connection; dropped when there is
+  // none. None is a reply bound to a request.
+  void sendPassResponse();                  // {"Response": true}
+  void sendFailResponse();                  // {"Response": false}
+  void sendProgress(int64_t percent);       // {"Progress": percent}
+  void sendData(const Bytes& bytes);        // {"Data": bytes}
+
+  // The commands. Each takes the request key's value and returns the result
+  // that becomes the "Response"; each first logs
+  // "Entering %s with parameter: %@" with its method name.
+  bool migratePreferencesFile(const Value& parameter);
+  bool prepareLogContainer(const Value& parameter);
+  bool prepareWorkContainer(const Value& parameter);
+  bool removeWorkContainer(const Value& parameter);
+
+ private:
+  void send(const char* key, XpcObject value);
+
+  std::weak_ptr<Connection> connection_;
+};
+
+}  // namespace vtr
+
+#endif  // VTR_VITD_HELPER_MESSAGE_RESPONDER_H_
