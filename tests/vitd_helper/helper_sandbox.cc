@@ -1,0 +1,180 @@
+#include "tests/vitd_helper/helper_sandbox.h"
+
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <sstream>
+#include <thread>
+
+#include <gtest/gtest.h>
+
+#include "tests/support/test_support.h"
+#include "xpc/client.h"
+
+namespace vtr::testing {
+namespace {
+
+void MakeDirs(const std::string& path) {
+  std::string prefix;
+  std::stringstream parts(path);
+  std::string part;
+  while (std::getline(parts, part, '/')) {
+    if (part.empty()) continue;
+    prefix += "/" + part;
+    ::mkdir(prefix.c_str(), 0755);
+  }
+}
+
+int StatusOf(int raw) { return WIFEXITED(raw) ? WEXITSTATUS(raw) : -1; }
+
+}  // namespace
+
+std::string HelperExecutable() { return std::string(VTR_BINARY_DIR) + "/bin/vitd_helper"; }
+std::string VitdctlExecutable() { return std::string(VTR_BINARY_DIR) + "/bin/vitdctl"; }
+std::string UnentitledVitdctlExecutable() { return std::string(VTR_BINARY_DIR) + "/tests/vitdctl_unentitled"; }
+std::string StringEntitledVitdctlExecutable() { return std::string(VTR_BINARY_DIR) + "/tests/vitdctl_string_entitled"; }
+
+HelperSandbox::HelperSandbox() {
+  // A short path: the socket path must fit in 108 bytes.
+  char pattern[] = "/tmp/vh.XXXXXX";
+  if (::mkdtemp(pattern) == nullptr) ADD_FAILURE() << "mkdtemp failed";
+  root_ = pattern;
+  ::chmod(root_.c_str(), 0755);
+  for (const char* dir : {"/etc", "/run", "/private/var/root/Library/Preferences",
+                          "/private/var/mobile/Library/Preferences", "/private/var/logs"}) {
+    MakeDirs(root_ + dir);
+  }
+  ::symlink("private/var", (root_ + "/var").c_str());
+  WriteFile(root_ + "/etc/passwd",
+            "root:x:0:0:root:/var/root:/bin/sh\nmobile:x:501:501:Mobile User:/var/mobile:/bin/sh\n");
+  WriteFile(root_ + "/etc/group", "root:x:0:\nmobile:x:501:\n");
+  logPath_ = root_ + ".log";
+}
+
+HelperSandbox::~HelperSandbox() {
+  if (pid_ > 0) {
+    ::kill(pid_, SIGKILL);
+    ::waitpid(pid_, nullptr, 0);
+  }
+  RemoveTree(root_);
+  ::unlink(logPath_.c_str());
+}
+
+bool HelperSandbox::start() {
+  const std::string helper = HelperExecutable();
+  const std::string root = root_;
+  const int logFd = ::open(logPath_.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
+  pid_ = ::fork();
+  if (pid_ == 0) {
+    ::dup2(logFd, STDERR_FILENO);
+    const int devnull = ::open("/dev/null", O_RDWR);
+    ::dup2(devnull, STDIN_FILENO);
+    ::dup2(devnull, STDOUT_FILENO);
+    ::execl(helper.c_str(), helper.c_str(), "--root", root.c_str(), "--stderr", static_cast<char*>(nullptr));
+    ::_exit(127);
+  }
+  ::close(logFd);
+  for (int i = 0; i < 200; ++i) {
+    struct stat st;
+    if (::stat(socketPath().c_str(), &st) == 0 && S_ISSOCK(st.st_mode)) return true;
+    if (!running()) return false;
+    std::this_thread::sleep_for(std::chrono::milliseconds(20));
+  }
+  return false;
+}
+
+std::vector<XpcObject> HelperSandbox::request(const XpcObject& request, size_t expected,
+                                              std::chrono::milliseconds quiet) {
+  std::vector<XpcObject> messages;
+  Result<XpcClient> client = XpcClient::Connect(socketPath());
+  if (!client.ok()) {
+    ADD_FAILURE() << "connect: " << client.error().description();
+    return messages;
+  }
+  if (Status s = client->send(request); !s.ok()) {
+    ADD_FAILURE() << "send: " << s.error().description();
+    return messages;
+  }
+  size_t responses = 0;
+  while (responses < expected) {
+    Result<XpcObject> message = client->receive(quiet);
+    if (!message.ok()) break;
+    if (message->find("Response") != nullptr) ++responses;
+    messages.push_back(std::move(message).value());
+  }
+  return messages;
+}
+
+HelperSandbox::RunResult HelperSandbox::run(const std::string& executable,
+                                            const std::vector<std::string>& args) const {
+  int out[2];
+  if (::pipe2(out, O_CLOEXEC) != 0) return {};
+  const pid_t pid = ::fork();
+  if (pid == 0) {
+    ::dup2(out[1], STDOUT_FILENO);
+    std::vector<char*> argv;
+    argv.push_back(const_cast<char*>(executable.c_str()));
+    for (const std::string& a : args) argv.push_back(const_cast<char*>(a.c_str()));
+    argv.push_back(nullptr);
+    ::execv(executable.c_str(), argv.data());
+    ::_exit(127);
+  }
+  ::close(out[1]);
+  RunResult result;
+  char buf[4096];
+  ssize_t n;
+  while ((n = ::read(out[0], buf, sizeof buf)) > 0) result.output.append(buf, static_cast<size_t>(n));
+  ::close(out[0]);
+  int raw = 0;
+  ::waitpid(pid, &raw, 0);
+  result.status = StatusOf(raw);
+  return result;
+}
+
+bool HelperSandbox::running() {
+  if (pid_ <= 0) return false;
+  int raw = 0;
+  if (::waitpid(pid_, &raw, WNOHANG) == 0) return true;
+  exitStatus_ = StatusOf(raw);
+  pid_ = -1;
+  return false;
+}
+
+int HelperSandbox::waitForExit(std::chrono::milliseconds timeout) {
+  if (pid_ <= 0) return exitStatus_;
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  while (std::chrono::steady_clock::now() < deadline) {
+    int raw = 0;
+    const pid_t r = ::waitpid(pid_, &raw, WNOHANG);
+    if (r == pid_) {
+      pid_ = -1;
+      exitStatus_ = StatusOf(raw);
+      return exitStatus_;
+    }
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  }
+  return -1;
+}
+
+int HelperSandbox::terminate() {
+  if (pid_ <= 0) return exitStatus_;
+  ::kill(pid_, SIGTERM);
+  return waitForExit(std::chrono::seconds(10));
+}
+
+std::string HelperSandbox::log() const { return ReadFile(logPath_); }
+
+bool HelperSandbox::logged(const std::string& line) const {
+  std::stringstream lines(log());
+  std::string l;
+  while (std::getline(lines, l)) {
+    if (l == line) return true;
+  }
+  return false;
+}
+
+}  // namespace vtr::testing

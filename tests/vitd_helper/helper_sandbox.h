@@ -1,0 +1,83 @@
+// A running vitd_helper confined to a fresh sandbox root, for end-to-end
+// tests over its socket. The root holds the accounts (root, mobile = 501)
+// and the folders the helper expects (/private/var with /var linking to it,
+// /run for the socket). Needs root (the helper chroots).
+#ifndef VTR_TESTS_VITD_HELPER_HELPER_SANDBOX_H_
+#define VTR_TESTS_VITD_HELPER_HELPER_SANDBOX_H_
+
+#include <sys/types.h>
+
+#include <chrono>
+#include <string>
+#include <vector>
+
+#include "xpc/xpc_object.h"
+
+namespace vtr::testing {
+
+inline constexpr uid_t kMobileUid = 501;
+inline constexpr gid_t kMobileGid = 501;
+
+class HelperSandbox {
+ public:
+  // Makes the root; the helper is not started yet.
+  HelperSandbox();
+  // Kills the helper if it still runs and removes the root.
+  ~HelperSandbox();
+  HelperSandbox(const HelperSandbox&) = delete;
+  HelperSandbox& operator=(const HelperSandbox&) = delete;
+
+  // Starts the helper with --root and --stderr and waits for its socket.
+  // False when it did not come up within a few seconds.
+  bool start();
+
+  // The host path of a path inside the root ("/private/var/x" ->
+  // "<root>/private/var/x").
+  std::string host(const std::string& inside) const { return root_ + inside; }
+  const std::string& root() const { return root_; }
+  std::string socketPath() const { return root_ + "/run/com.orvane.vitrelldhelper.sock"; }
+
+  // Sends request from this process (which carries the entitlement) and
+  // collects what comes back until `expected` "Response" messages have
+  // arrived or nothing came for `quiet`.
+  std::vector<XpcObject> request(const XpcObject& request, size_t expected,
+                                 std::chrono::milliseconds quiet = std::chrono::milliseconds(3000));
+
+  // Runs a client executable with arguments (e.g. a vitdctl variant with
+  // "--root <root> --timeout 1 prepareWorkContainer /x"); returns its exit
+  // status and its standard output.
+  struct RunResult {
+    int status = -1;
+    std::string output;
+  };
+  RunResult run(const std::string& executable, const std::vector<std::string>& args) const;
+
+  // Sends SIGTERM and waits for the helper; its exit status (or -1 when it
+  // was killed by a signal or did not end in time).
+  int terminate();
+  // Waits up to timeout for the helper to exit by itself; its status or -1.
+  int waitForExit(std::chrono::milliseconds timeout);
+  bool running();
+
+  // Everything the helper logged so far (its standard error).
+  std::string log() const;
+  // True when some line of the log equals line.
+  bool logged(const std::string& line) const;
+
+ private:
+  std::string root_;
+  std::string logPath_;
+  pid_t pid_ = -1;
+  int exitStatus_ = -1;  // once the helper was reaped
+};
+
+// The vitd_helper and vitdctl executables of this build, and vitdctl built
+// without an entitlement and with a string-valued one.
+std::string HelperExecutable();
+std::string VitdctlExecutable();
+std::string UnentitledVitdctlExecutable();
+std::string StringEntitledVitdctlExecutable();
+
+}  // namespace vtr::testing
+
+#endif  // VTR_TESTS_VITD_HELPER_HELPER_SANDBOX_H_
