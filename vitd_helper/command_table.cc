@@ -13,6 +13,9 @@ constexpr std::array kCommands = {
     Command{"prepareLogContainer:", &R::prepareLogContainer},
     Command{"prepareWorkContainer:", &R::prepareWorkContainer},
     Command{"removeWorkContainer:", &R::removeWorkContainer},
+    Command{"createDeviceManifest:", &R::createDeviceManifest},
+    Command{"createHardLink:", &R::createHardLink},
+    Command{"moveStagingToFinal:", &R::moveStagingToFinal},
 };
 
 }  // namespace

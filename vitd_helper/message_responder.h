@@ -55,6 +55,9 @@ class VTRHMessageResponder {
   bool prepareLogContainer(const Value& parameter);
   bool prepareWorkContainer(const Value& parameter);
   bool removeWorkContainer(const Value& parameter);
+  bool createDeviceManifest(const Value& parameter);
+  bool createHardLink(const Value& parameter);
+  bool moveStagingToFinal(const Value& parameter);
 
  private:
   void send(const char* key, XpcObject value);

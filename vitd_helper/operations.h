@@ -35,6 +35,24 @@ class VTRHOperations {
 
   // Removes path with everything below it; true when it was not there.
   bool removeDirectory(const std::string& path);
+
+  // Records the metadata of the tree at path into the device manifest
+  // "/private/var/VTRWorkContainer/DeviceManifest.plist", a binary property
+  // list written whole or not at all. Any of "/private", "/private/",
+  // "/private/var" and "/private/var/" selects the whole device: the scan of
+  // "/private/var" keyed relative to "/private", without the application
+  // areas, reporting progress. Any other path is scanned relative to itself
+  // without its immediate hidden entries. inclusive adds the scanned
+  // directory itself. The result is the scan's; a file that cannot be
+  // written is not a failure.
+  bool createDeviceManifest(const std::string& path, bool inclusive);
+
+  // Makes stagingPath a hard link of source (a directory: its directories
+  // recreated, its files linked, its symbolic links recreated).
+  bool createHardLinks(const std::string& source, const std::string& stagingPath);
+
+  // Moves the staging directory to "/var/backup", replacing what was there.
+  bool moveStagingToFinal(const std::string& stagingPath);
 };
 
 }  // namespace vtr
