@@ -38,15 +38,27 @@ enum class PlistFormat { kBinary, kXml };
 // Reads a property list in either format (told apart by the "bplist00" magic).
 Result<Value> ReadPropertyList(std::span<const uint8_t> bytes, const PlistLimits& limits = {});
 Result<Value> ReadBinaryPropertyList(std::span<const uint8_t> bytes, const PlistLimits& limits = {});
+// XML is read strictly: no entity is declared, expanded or loaded (a document
+// type with an internal subset is refused; the usual one-line document type
+// is accepted and never fetched), only the property-list elements are known,
+// and each value's text must be whole and valid: <integer> decimal with an
+// optional sign or "0x" hex, up to UINT64_MAX (above INT64_MAX an unsigned
+// value); <real> decimal, "nan" or "inf"; <date> "YYYY-MM-DDTHH:MM:SSZ";
+// <data> padded base64. Surrounding whitespace is not trimmed.
 Result<Value> ReadXmlPropertyList(std::span<const uint8_t> bytes, const PlistLimits& limits = {});
 
 // Reads the file at path (a regular file; a symbolic link at the last
-// component is refused) and parses it as above.
+// component is refused, and so is a file larger than limits.maxInputBytes
+// before any of it is read) and parses it as above. Errors name the path.
 Result<Value> ReadPropertyListFile(const std::string& path, const PlistLimits& limits = {});
 
 // The property list of value in the given format. Nil values cannot be
 // written and make these fail.
 Result<Bytes> EncodeBinaryPropertyList(const Value& value);
+// XML also fails on a string or key that is not UTF-8 or holds a character
+// XML cannot carry (controls other than tab, line feed and carriage return;
+// U+FFFE, U+FFFF), and on a date outside the years 0000-9999. Dates are
+// written to the whole second (the fraction is dropped).
 Result<std::string> EncodeXmlPropertyList(const Value& value);
 
 // Writes value to path atomically (temporary file, fsync, rename, fsync of
