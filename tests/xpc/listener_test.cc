@@ -1,0 +1,232 @@
+// The listener end to end over real sockets: misbehaving clients lose their
+// own connection and nothing else, and the loop keeps serving the others.
+#include <sys/stat.h>
+
+#include <algorithm>
+#include <string>
+#include <vector>
+
+#include <gtest/gtest.h>
+
+#include "tests/xpc/test_server.h"
+
+namespace vtr::testing {
+namespace {
+
+XpcBytes Header(uint32_t n) { return {uint8_t(n), uint8_t(n >> 8), uint8_t(n >> 16), uint8_t(n >> 24)}; }
+
+XpcBytes Concat(std::initializer_list<XpcBytes> parts) {
+  XpcBytes all;
+  for (const XpcBytes& part : parts) all.insert(all.end(), part.begin(), part.end());
+  return all;
+}
+
+XpcBytes Frame(const XpcBytes& body) { return Concat({Header(static_cast<uint32_t>(body.size())), body}); }
+
+// {"k": <value bytes>}
+XpcBytes DictWith(const XpcBytes& value) { return Concat({{0x0A, 1, 0, 0, 0, 1, 0, 0, 0, 'k'}, value}); }
+
+bool AnyReasonContains(const TestServer& server, const std::string& text) {
+  return std::any_of(server.invalidReasons.begin(), server.invalidReasons.end(),
+                     [&](const std::string& reason) { return reason.find(text) != std::string::npos; });
+}
+
+TEST(ListenerTest, HostileFramesCloseOnlyTheirConnection) {
+  XpcBytes nested;
+  for (int i = 0; i <= kMaxMessageDepth; ++i) nested = Concat({nested, {0x09, 1, 0, 0, 0}});
+  nested.push_back(0);
+  struct Case {
+    const char* name;
+    XpcBytes bytes;
+    const char* reason;
+  };
+  const Case cases[] = {
+      {"length 0", Header(0), "frame length 0"},
+      {"length over 16 MiB", Header(kMaxFrameBodyBytes + 1), "exceeds the limit"},
+      {"unknown tag", Frame(DictWith({0x42})), "unknown tag 0x42"},
+      {"bool byte 7", Frame(DictWith({0x01, 7})), "bool byte 0x07"},
+      {"truncated payload", Frame(DictWith({0x02, 1, 2, 3})), "truncated int64"},
+      {"bytes left over", Frame(Concat({DictWith({0x00}), {0x00}})), "left over"},
+      {"NUL in string", Frame(DictWith({0x07, 2, 0, 0, 0, 'a', 0})), "NUL byte in a string"},
+      {"duplicate key", Frame({0x0A, 2, 0, 0, 0, 1, 0, 0, 0, 'k', 0, 1, 0, 0, 0, 'k', 0}), "duplicate key"},
+      {"nesting 65", Frame(Concat({{0x0A, 1, 0, 0, 0, 1, 0, 0, 0, 'k'}, nested})), "nesting deeper than 64"},
+      {"top level array", Frame({0x09, 0, 0, 0, 0}), "not a dictionary"},
+      {"huge count", Frame({0x0A, 0xFF, 0xFF, 0xFF, 0xFF}), "exceeds the 0 bytes left"},
+  };
+  TestServer server;
+  // One well-behaved client stays connected through all of it.
+  Result<XpcClient> steady = XpcClient::Connect(server.path());
+  ASSERT_TRUE(steady.ok());
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.name);
+    UniqueFd hostile = ConnectRaw(server.path());
+    SendRaw(hostile.get(), c.bytes);
+    EXPECT_TRUE(ClosedByPeer(hostile.get()));
+    EXPECT_TRUE(server.waitUntil([&](TestServer& s) { return AnyReasonContains(s, c.reason); }));
+    ExpectServed(server.path());
+    ASSERT_TRUE(steady->send(Ping()).ok());
+    Result<XpcObject> reply = steady->receive(kPatience);
+    ASSERT_TRUE(reply.ok()) << reply.error().description();
+  }
+}
+
+TEST(ListenerTest, StalledHalfFrameDelaysNobodyAndIsKept) {
+  TestServer server;
+  XpcBytes frame = *EncodeFrame(Ping("slow"));
+  UniqueFd stalled = ConnectRaw(server.path());
+  SendRaw(stalled.get(), std::span(frame).first(frame.size() / 2));
+  ExpectServed(server.path());
+  ExpectServed(server.path());
+  // The stalled client's half frame was kept: the rest completes it.
+  SendRaw(stalled.get(), std::span(frame).subspan(frame.size() / 2));
+  XpcClient late{std::move(stalled)};
+  Result<XpcObject> reply = late.receive(kPatience);
+  ASSERT_TRUE(reply.ok()) << reply.error().description();
+  EXPECT_EQ(*reply, Reply());
+}
+
+TEST(ListenerTest, HundredsOfIdleConnectionsDoNotStopService) {
+  TestServer server;
+  std::vector<UniqueFd> idle;
+  for (int i = 0; i < 300; ++i) idle.push_back(ConnectRaw(server.path()));
+  // Some of them have sent a header and nothing else.
+  for (int i = 0; i < 300; i += 3) SendRaw(idle[i].get(), Header(1000));
+  ExpectServed(server.path());
+  EXPECT_TRUE(server.waitUntil([](TestServer& s) { return s.connections == 301; }));
+  idle.clear();
+  EXPECT_TRUE(server.waitUntil([](TestServer& s) { return s.invalidReasons.size() == 301; }));
+  EXPECT_TRUE(AnyReasonContains(server, "in the middle of a frame"));
+}
+
+TEST(ListenerTest, EveryEndIsReportedOnceWithItsReason) {
+  TestServer server(ListenerOptions{}, [](TestServer&, const std::shared_ptr<Connection>& connection,
+                                          const XpcObject& message) {
+    if (message.find("cancel")) {
+      connection->cancel();
+      connection->cancel();
+      EXPECT_FALSE(connection->send(Reply()).ok());
+      return;
+    }
+    // Several frames in one write are answered in order.
+    EXPECT_TRUE(connection->send(message).ok());
+  });
+  {
+    UniqueFd quiet = ConnectRaw(server.path());
+  }
+  EXPECT_TRUE(server.waitUntil([](TestServer& s) { return s.invalidReasons.size() == 1; }));
+  EXPECT_EQ(server.invalidReasons[0], "closed by the peer");
+
+  Result<XpcClient> client = XpcClient::Connect(server.path());
+  ASSERT_TRUE(client.ok());
+  XpcBytes batch = Concat({*EncodeFrame(Ping("a")), *EncodeFrame(Ping("b")), *EncodeFrame(Ping("cancel")),
+                           *EncodeFrame(Ping("never"))});
+  SendRaw(client->fd(), batch);
+  EXPECT_EQ(*client->receive(kPatience), Ping("a"));
+  EXPECT_EQ(*client->receive(kPatience), Ping("b"));
+  Result<XpcObject> end = client->receive(kPatience);
+  ASSERT_FALSE(end.ok());
+  EXPECT_EQ(end.error().code(), ECONNRESET);
+  EXPECT_TRUE(server.waitUntil([](TestServer& s) { return s.invalidReasons.size() == 2; }));
+  EXPECT_EQ(server.invalidReasons[1], "cancelled");
+  EXPECT_EQ(server.messages, 3u);  // "never" came after the cancel
+}
+
+TEST(ListenerTest, ConnectionsBeyondTheCapAreClosedAtOnce) {
+  ListenerOptions options;
+  options.maxConnections = 2;
+  TestServer server(options);
+  Result<XpcClient> first = XpcClient::Connect(server.path());
+  Result<XpcClient> second = XpcClient::Connect(server.path());
+  ASSERT_TRUE(first.ok() && second.ok());
+  ASSERT_TRUE(server.waitUntil([](TestServer& s) { return s.connections == 2; }));
+  UniqueFd third = ConnectRaw(server.path());
+  EXPECT_TRUE(ClosedByPeer(third.get()));
+  *first = XpcClient(UniqueFd());
+  ASSERT_TRUE(server.waitUntil([](TestServer& s) { return s.invalidReasons.size() == 1; }));
+  ExpectServed(server.path());
+}
+
+TEST(ListenerTest, PartialFramesOverTheBudgetDropTheLargest) {
+  ListenerOptions options;
+  options.partialFrameBudget = 1 << 20;
+  TestServer server(options);
+  UniqueFd hog = ConnectRaw(server.path());
+  SendRaw(hog.get(), Concat({Header(8 << 20), XpcBytes(1000 << 10, 0x0A)}));
+  ASSERT_TRUE(server.waitUntil([](TestServer& s) { return s.connections == 1; }));
+
+  // A request of 300 KiB pushes the total over the budget: the hog goes,
+  // the request is served.
+  Result<XpcClient> client = XpcClient::Connect(server.path());
+  ASSERT_TRUE(client.ok());
+  ASSERT_TRUE(client->send(XpcObject::Dictionary({{"Data", XpcObject::Data(XpcBytes(300 << 10, 7))}})).ok());
+  Result<XpcObject> reply = client->receive(kPatience);
+  ASSERT_TRUE(reply.ok()) << reply.error().description();
+  EXPECT_TRUE(ClosedByPeer(hog.get()));
+  EXPECT_TRUE(server.waitUntil([](TestServer& s) { return AnyReasonContains(s, "memory budget"); }));
+}
+
+TEST(ListenerTest, AClientThatStopsReadingIsDropped) {
+  ListenerOptions options;
+  options.sendTimeout = std::chrono::milliseconds(200);
+  Status lastSend;
+  TestServer server(options, [&](TestServer&, const std::shared_ptr<Connection>& connection, const XpcObject& message) {
+    if (!message.find("flood")) {
+      (void)connection->send(Reply());
+      return;
+    }
+    XpcObject big = XpcObject::Dictionary({{"Data", XpcObject::Data(XpcBytes(1 << 20))}});
+    for (int i = 0; i < 256 && connection->valid(); ++i) lastSend = connection->send(big);
+  });
+  Result<XpcClient> reader = XpcClient::Connect(server.path());
+  ASSERT_TRUE(reader.ok());
+  ASSERT_TRUE(reader->send(Ping("flood")).ok());  // and never reads
+  ASSERT_TRUE(server.waitUntil([](TestServer& s) { return s.invalidReasons.size() == 1; }));
+  EXPECT_NE(server.invalidReasons[0].find("send failed"), std::string::npos) << server.invalidReasons[0];
+  EXPECT_FALSE(lastSend.ok());
+  EXPECT_EQ(lastSend.error().code(), ETIMEDOUT);
+  ExpectServed(server.path());
+}
+
+TEST(ListenerTest, CancelledListenerReportsInvalidAndKeepsItsConnections) {
+  TestServer server(ListenerOptions{}, [](TestServer& s, const std::shared_ptr<Connection>& connection,
+                                          const XpcObject&) {
+    s.listener().cancel();
+    (void)connection->send(Reply());
+  });
+  Result<XpcClient> client = XpcClient::Connect(server.path());
+  ASSERT_TRUE(client.ok());
+  ASSERT_TRUE(client->send(Ping()).ok());
+  ASSERT_TRUE(client->receive(kPatience).ok());
+  ASSERT_TRUE(server.waitUntil([](TestServer& s) { return s.listenerEvents.size() == 1; }));
+  EXPECT_EQ(server.listenerEvents[0].kind, ListenerEvent::Kind::kConnectionInvalid);
+  EXPECT_FALSE(XpcClient::Connect(server.path()).ok());
+  ASSERT_TRUE(client->send(Ping()).ok());
+  EXPECT_TRUE(client->receive(kPatience).ok());
+}
+
+TEST(ListenerTest, CreateAtPathReplacesOnlyAStaleSocket) {
+  TempDir dir;
+  std::string path = dir / "s.sock";
+  {
+    Result<std::unique_ptr<Listener>> first = Listener::CreateAtPath(path);
+    ASSERT_TRUE(first.ok()) << first.error().description();
+    struct stat st;
+    ASSERT_EQ(::stat(path.c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 07777, 0666u);
+    Result<std::unique_ptr<Listener>> second = Listener::CreateAtPath(path);
+    ASSERT_FALSE(second.ok());
+    EXPECT_EQ(second.error().code(), EADDRINUSE);
+  }
+  // The first listener is gone; its socket file stayed behind.
+  EXPECT_TRUE(Listener::CreateAtPath(path).ok());
+
+  WriteFile(dir / "file", "not a socket");
+  Result<std::unique_ptr<Listener>> onFile = Listener::CreateAtPath(dir / "file");
+  ASSERT_FALSE(onFile.ok());
+  EXPECT_EQ(onFile.error().code(), EEXIST);
+  EXPECT_EQ(ReadFile(dir / "file"), "not a socket");
+  EXPECT_FALSE(Listener::CreateAtPath(dir / std::string(120, 'x')).ok());
+}
+
+}  // namespace
+}  // namespace vtr::testing

@@ -1,0 +1,106 @@
+// Connection: one accepted client of the helper's listener.
+//
+// The listener owns every live connection and hands each to its handlers as
+// a shared_ptr; whoever merely needs to reach the current client (the
+// message responder) keeps a weak_ptr. A connection delivers, through the
+// event handler set on it, one message event per dictionary received, in
+// order, and finally exactly one invalid event: when the peer closes, breaks
+// the protocol (the reason says which rule), stops reading while the helper
+// writes to it, is cancelled, or is dropped to keep the listener's limits.
+// After the invalid event the connection lets go of its handler, so a
+// handler may capture its own connection without leaking it.
+//
+// Threads: a connection belongs to the thread running its listener's loop;
+// every call must be made there (in practice from inside an event handler).
+#ifndef VTR_XPC_CONNECTION_H_
+#define VTR_XPC_CONNECTION_H_
+
+#include <chrono>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <span>
+#include <string>
+
+#include "platform/result.h"
+#include "platform/unique_fd.h"
+#include "xpc/frame_assembler.h"
+#include "xpc/peer_identity.h"
+#include "xpc/xpc_object.h"
+
+namespace vtr {
+
+class Listener;
+
+struct ConnectionEvent {
+  enum class Kind { kMessage, kInvalid };
+  Kind kind;
+  // kMessage: the dictionary received.
+  XpcObject message;
+  // kInvalid: why the connection ended, e.g. "closed by the peer" or
+  // "protocol error: unknown tag 0x0b at offset 5".
+  std::string reason;
+};
+
+class Connection : public std::enable_shared_from_this<Connection> {
+ public:
+  using EventHandler = std::function<void(const ConnectionEvent&)>;
+
+  ~Connection();
+  Connection(const Connection&) = delete;
+  Connection& operator=(const Connection&) = delete;
+
+  // Sets the handler for this connection's events. Set it from the
+  // listener's connection event: messages that arrive while no handler is
+  // set are dropped.
+  void setEventHandler(EventHandler handler);
+
+  // Writes message (a dictionary) as one frame, waiting at most the send
+  // timeout for the peer to make room. An Error when the message cannot be
+  // encoded (the connection stays), and when the connection is closed or the
+  // write fails or times out; in the latter cases the connection is closed
+  // and its invalid event follows once the current handler has returned.
+  Status send(const XpcObject& message);
+
+  // Closes the connection; its invalid event ("cancelled") follows once the
+  // current handler has returned. Harmless when already closed.
+  void cancel();
+
+  // False once the connection is closed (its invalid event may still be due).
+  bool valid() const { return socket_.valid(); }
+
+  // The peer as captured at accept.
+  const PeerIdentity& peer() const { return peer_; }
+
+ private:
+  friend class Listener;
+
+  Connection(Listener* owner, uint64_t token, UniqueFd socket, PeerIdentity peer, std::chrono::milliseconds sendTimeout);
+
+  // Reads what the socket has (one read into scratch) and delivers the
+  // messages completed by it; closes on end of stream or protocol error.
+  void readReady(std::span<uint8_t> scratch);
+  // Closes the socket and has the owner queue the invalid event.
+  void close(std::string reason);
+  // Delivers the invalid event and drops the handler.
+  void deliverInvalid();
+  // Closes without any event (the listener is going away).
+  void detach();
+  // Tells the owner how the bytes held for the frame in progress changed.
+  void reportBuffered();
+  size_t bufferedBytes() const { return assembler_.bufferedBytes(); }
+
+  Listener* owner_;
+  uint64_t token_;
+  UniqueFd socket_;
+  PeerIdentity peer_;
+  std::chrono::milliseconds sendTimeout_;
+  FrameAssembler assembler_;
+  size_t reportedBuffered_ = 0;
+  EventHandler handler_;
+  std::string invalidReason_;
+};
+
+}  // namespace vtr
+
+#endif  // VTR_XPC_CONNECTION_H_
