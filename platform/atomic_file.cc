@@ -57,6 +57,11 @@ AtomicFile::AtomicFile(AtomicFile&& other) noexcept
   other.committed_ = true;  // the moved-from object owns nothing to clean up
 }
 
+std::string AtomicFile::temporaryPath() const {
+  const size_t slash = path_.rfind('/');
+  return (slash == std::string::npos ? std::string() : path_.substr(0, slash + 1)) + tempName_;
+}
+
 AtomicFile::~AtomicFile() {
   if (!committed_ && dir_) ::unlinkat(dir_.get(), tempName_.c_str(), 0);
 }

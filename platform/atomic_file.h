@@ -32,6 +32,8 @@ class AtomicFile {
   // The temporary file, open for writing.
   int fd() const { return fd_.get(); }
   const std::string& path() const { return path_; }
+  // Where the bytes go until commit(): ".NAME.XXXXXX" beside the target.
+  std::string temporaryPath() const;
 
   // fsync the file, rename it over the target, fsync the directory.
   Status commit();

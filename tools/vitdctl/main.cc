@@ -24,14 +24,17 @@ void PrintUsage(FILE* out) {
                "back as one line of JSON ({\"Response\":true}, {\"Progress\":42}, {\"Data\":\"...\"}).\n"
                "On a terminal, progress is drawn as a bar.\n"
                "\n"
-               "Commands:\n"
-               "  send FILE|-%*s a request dictionary from FILE (XML or binary property list,\n"
-               "  %*s JSON when FILE ends in .json or starts with '{')\n",
-               26, "", 36, "");
-  for (const SubCommand& c : SubCommands()) {
-    const std::string head = std::string(c.name) + (*c.usage ? " " : "") + c.usage;
-    std::fprintf(out, "  %-36s %s\n", head.c_str(), c.summary);
-  }
+               "Commands:\n");
+  auto item = [out](const std::string& head, const char* summary) {
+    if (head.size() <= 30) {
+      std::fprintf(out, "  %-30s %s\n", head.c_str(), summary);
+    } else {
+      std::fprintf(out, "  %s\n  %-30s %s\n", head.c_str(), "", summary);
+    }
+  };
+  item("send FILE|-", "send the request dictionary in FILE: an XML or binary");
+  item("", "property list, or JSON (FILE ends in .json or starts with '{')");
+  for (const SubCommand& c : SubCommands()) item(std::string(c.name) + (*c.usage ? " " : "") + c.usage, c.summary);
   std::fprintf(out,
                "\n"
                "Options:\n"

@@ -86,6 +86,27 @@ Result<XpcObject> OnePath(const std::vector<std::string>& args) {
   return XpcObject::String(args[0]);
 }
 
+Result<XpcObject> ManifestParameter(const std::vector<std::string>& args) {
+  std::string path;
+  bool inclusive = false;
+  for (const std::string& arg : args) {
+    if (arg == "--inclusive") {
+      inclusive = true;
+    } else if (path.empty()) {
+      path = arg;
+    } else {
+      return Error::Invalid("takes one PATH and --inclusive");
+    }
+  }
+  if (path.empty()) return Error::Invalid("takes a PATH");
+  return XpcObject::Dictionary({{"Path", XpcObject::String(path)}, {"Inclusive", XpcObject::Bool(inclusive)}});
+}
+
+Result<XpcObject> HardLinkParameter(const std::vector<std::string>& args) {
+  if (args.size() != 2) return Error::Invalid("takes FILE and STAGING_PATH");
+  return XpcObject::Dictionary({{"FilePath", XpcObject::String(args[0])}, {"StagingPath", XpcObject::String(args[1])}});
+}
+
 }  // namespace
 
 XpcObject XpcObjectFromValue(const Value& value) {
@@ -145,6 +166,11 @@ const std::vector<SubCommand>& SubCommands() {
       {"prepareWorkContainer", "PATH", "create a work directory writable by mobile, without VTR_staging",
        OnePath},
       {"removeWorkContainer", "PATH", "remove a directory and everything below it", OnePath},
+      {"createDeviceManifest", "PATH [--inclusive]",
+       "write the manifest of PATH (/private/var: the whole device) to the work container", ManifestParameter},
+      {"createHardLink", "FILE STAGING_PATH", "hard-link FILE (a directory: its tree) at STAGING_PATH",
+       HardLinkParameter},
+      {"moveStagingToFinal", "PATH", "move the staging directory PATH to /var/backup", OnePath},
   };
   return commands;
 }

@@ -1,0 +1,180 @@
+// The manifest and staging commands, end to end in a sandbox root.
+#include <sys/stat.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include "platform/plist.h"
+#include "tests/support/test_support.h"
+#include "tests/vitd_helper/helper_sandbox.h"
+
+namespace vtr::testing {
+namespace {
+
+using namespace std::chrono_literals;
+
+constexpr char kManifest[] = "/private/var/VTRWorkContainer/DeviceManifest.plist";
+
+struct stat Lstat(const std::string& path) {
+  struct stat st = {};
+  ::lstat(path.c_str(), &st);
+  return st;
+}
+
+bool Exists(const std::string& path) { return ::access(path.c_str(), F_OK) == 0 || Lstat(path).st_mode != 0; }
+
+void MakeDir(const std::string& path, mode_t mode = 0755) { ASSERT_EQ(::mkdir(path.c_str(), mode), 0) << path; }
+
+class ManifestTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    if (!IsRoot()) GTEST_SKIP() << "the helper chroots into its sandbox root: needs root";
+    MakeDir(sandbox_.host("/private/var/VTRWorkContainer"));
+    // A small device: files, a link, a dangling link, extended attributes,
+    // owners, a fifo (never opened), hidden entries, the application areas.
+    const std::string var = sandbox_.host("/private/var");
+    MakeDir(var + "/mobile/Library/Media");
+    WriteFile(var + "/mobile/Library/Media/photo.jpg", std::string(300000, 'p'));
+    WriteFile(var + "/mobile/Library/empty", "");
+    WriteFile(var + "/mobile/.hidden", "h");
+    MakeDir(var + "/mobile/.hiddendir");
+    WriteFile(var + "/mobile/.hiddendir/deep", "d");
+    MakeDir(var + "/mobile/Library/.deephidden");
+    ::symlink("Media/photo.jpg", (var + "/mobile/Library/link").c_str());
+    ::symlink("/nowhere", (var + "/mobile/Library/dangling").c_str());
+    ::symlink("/", (var + "/mobile/Library/rootlink").c_str());
+    ::setxattr((var + "/mobile/Library/Media/photo.jpg").c_str(), "user.tag", "\x00\x01zz", 4, 0);
+    ::lsetxattr((var + "/mobile/Library/link").c_str(), "trusted.linkattr", "L", 1, 0);
+    ::chown((var + "/mobile/Library/empty").c_str(), kMobileUid, kMobileGid);
+    ::chmod((var + "/mobile/Library/empty").c_str(), 04751);
+    ::mkfifo((var + "/mobile/Library/pipe").c_str(), 0644);
+    for (const char* area : {"Containers", "Applications", "BuildraBuiltProducts"}) {
+      MakeDir(var + "/mobile/" + area);
+      WriteFile(var + "/mobile/" + area + "/skipped", "s");
+    }
+    WriteFile(var + "/mobile/ContainersX", "kept: only /a/b and below are skipped, not /a/bc");
+    ASSERT_TRUE(sandbox_.start()) << sandbox_.log();
+  }
+
+  std::vector<XpcObject> createDeviceManifest(const std::string& path, bool inclusive) {
+    return sandbox_.request(
+        XpcObject::Dictionary({{"createDeviceManifest:", XpcObject::Dictionary({{"Path", XpcObject::String(path)},
+                                                                               {"Inclusive", XpcObject::Bool(inclusive)}})}}),
+        1, 10000ms);
+  }
+
+  // The independent check of the written manifest against the tree.
+  std::string check(const std::string& scanRoot, const std::string& relativeTo, std::vector<std::string> options) {
+    std::string command = std::string(VTR_SOURCE_DIR) + "/tests/vitd_helper/check_manifest.py " +
+                          sandbox_.host(kManifest) + " " + sandbox_.root() + " " + scanRoot + " " + relativeTo;
+    for (const std::string& o : options) command += " " + o;
+    return sandbox_.run("/bin/sh", {"-c", command + " 2>&1"}).output;
+  }
+
+  HelperSandbox sandbox_;
+};
+
+TEST_F(ManifestTest, WholeDeviceScanIsRelativeToPrivateSkipsTheApplicationAreasAndReportsProgress) {
+  std::vector<XpcObject> messages = createDeviceManifest("/private/var/", false);
+  ASSERT_FALSE(messages.empty());
+  EXPECT_EQ(messages.back(), XpcObject::Dictionary({{"Response", XpcObject::Bool(true)}}));
+  int64_t last = 0;
+  for (size_t i = 0; i + 1 < messages.size(); ++i) {
+    const XpcObject* progress = messages[i].find("Progress");
+    ASSERT_NE(progress, nullptr);
+    EXPECT_GT(*progress->int64Value(), last);  // rises only, never 0
+    last = *progress->int64Value();
+  }
+  EXPECT_GE(last, 100);
+  EXPECT_TRUE(sandbox_.logged("Device manifest created (for /private/var/)"));
+  EXPECT_TRUE(sandbox_.logged("/private/var/mobile/Library/pipe is special file. Leave it along"));
+
+  // The helper's own log changes while it scans, and the manifest did not
+  // exist yet: neither is compared.
+  const std::string report = check("/private/var", "/private",
+                                   {"--skip /private/var/mobile/Containers", "--skip /private/var/mobile/Applications",
+                                    "--skip /private/var/mobile/BuildraBuiltProducts", "--skip " + std::string(kManifest),
+                                    "--ignore /private/var/logs"});
+  EXPECT_NE(report.find(" 0 differences"), std::string::npos) << report;
+
+  Result<Value> manifest = ReadPropertyListFile(sandbox_.host(kManifest));
+  ASSERT_TRUE(manifest.ok());
+  EXPECT_TRUE(manifest->get("/var/mobile/Library/Media/photo.jpg").dictionary());
+  EXPECT_TRUE(manifest->get("/var/mobile/ContainersX").dictionary());
+  EXPECT_TRUE(manifest->get("/var/mobile/.hidden").dictionary());  // hidden entries count on a whole device
+  EXPECT_TRUE(manifest->get("/var/mobile/Containers").isNil());
+  EXPECT_TRUE(manifest->get("/var/mobile/Library/pipe").isNil());
+  EXPECT_TRUE(manifest->get("/var").isNil());  // not inclusive
+}
+
+TEST_F(ManifestTest, SubtreeIsRelativeToItselfAndSkipsOnlyItsImmediateHiddenEntries) {
+  std::vector<XpcObject> messages = createDeviceManifest("/private/var/mobile", true);
+  // No progress for anything but the whole device.
+  EXPECT_EQ(messages, std::vector<XpcObject>{XpcObject::Dictionary({{"Response", XpcObject::Bool(true)}})});
+  Result<Value> manifest = ReadPropertyListFile(sandbox_.host(kManifest));
+  ASSERT_TRUE(manifest.ok());
+  EXPECT_TRUE(manifest->get("/").dictionary());  // inclusive: the tree itself
+  EXPECT_TRUE(manifest->get("/Library/.deephidden").dictionary());
+  EXPECT_TRUE(manifest->get("/.hidden").isNil());
+  EXPECT_TRUE(manifest->get("/.hiddendir/deep").isNil());
+  EXPECT_TRUE(manifest->get("/Containers/skipped").dictionary());
+  EXPECT_EQ(*manifest->get("/Library/link").get("VTRManifestSymbolicLinkTargetFile").string(), "Media/photo.jpg");
+  EXPECT_EQ(*manifest->get("/Library/rootlink").get("VTRManifestSymbolicLinkTargetFile").string(), "/");
+  EXPECT_EQ(manifest->get("/Library/rootlink/private").type(), Value::Type::kNil);  // never followed
+
+  // A path that is not one of the four whole-device spellings is a subtree.
+  messages = createDeviceManifest("/private//var", false);
+  EXPECT_EQ(messages.size(), 1u);
+}
+
+TEST_F(ManifestTest, MissingWorkContainerStillAnswersTrueButWritesNothing) {
+  ASSERT_EQ(::rmdir(sandbox_.host("/private/var/VTRWorkContainer").c_str()), 0);
+  std::vector<XpcObject> messages = createDeviceManifest("/private/var/mobile/Library", false);
+  EXPECT_EQ(messages, std::vector<XpcObject>{XpcObject::Dictionary({{"Response", XpcObject::Bool(true)}})});
+  EXPECT_FALSE(Exists(sandbox_.host("/private/var/VTRWorkContainer")));
+  EXPECT_TRUE(sandbox_.logged("Device manifest created (for /private/var/mobile/Library)"));
+}
+
+TEST_F(ManifestTest, HardLinksAndMoveToFinal) {
+  auto request = [&](const std::string& key, XpcObject value) {
+    return sandbox_.request(XpcObject::Dictionary({{key, std::move(value)}}), 1);
+  };
+  const XpcObject yes = XpcObject::Dictionary({{"Response", XpcObject::Bool(true)}});
+  const XpcObject no = XpcObject::Dictionary({{"Response", XpcObject::Bool(false)}});
+  MakeDir(sandbox_.host("/private/var/staging"));
+  auto link = [](const std::string& from, const std::string& to) {
+    return XpcObject::Dictionary({{"FilePath", XpcObject::String(from)}, {"StagingPath", XpcObject::String(to)}});
+  };
+
+  // A file: same inode. A directory: its tree, files linked, links recreated.
+  EXPECT_EQ(request("createHardLink:", link("/private/var/mobile/Library/Media/photo.jpg", "/private/var/staging/p")),
+            std::vector<XpcObject>{yes});
+  EXPECT_EQ(Lstat(sandbox_.host("/private/var/staging/p")).st_ino,
+            Lstat(sandbox_.host("/private/var/mobile/Library/Media/photo.jpg")).st_ino);
+  EXPECT_EQ(request("createHardLink:", link("/private/var/mobile/Library/Media", "/private/var/staging/Media")),
+            std::vector<XpcObject>{yes});
+  EXPECT_EQ(Lstat(sandbox_.host("/private/var/staging/Media/photo.jpg")).st_ino,
+            Lstat(sandbox_.host("/private/var/mobile/Library/Media/photo.jpg")).st_ino);
+  // Onto an existing destination: refused with the link message.
+  EXPECT_EQ(request("createHardLink:", link("/private/var/mobile/.hidden", "/private/var/staging/p")),
+            std::vector<XpcObject>{no});
+  EXPECT_NE(sandbox_.log().find("Could not link /private/var/mobile/.hidden to /private/var/staging/p with error -"),
+            std::string::npos);
+
+  // Move to final: an old /var/backup is replaced; a file is no staging path.
+  MakeDir(sandbox_.host("/private/var/backup"));
+  WriteFile(sandbox_.host("/private/var/backup/old"), "old");
+  EXPECT_EQ(request("moveStagingToFinal:", XpcObject::String("/private/var/mobile/.hidden")),
+            std::vector<XpcObject>{no});
+  EXPECT_TRUE(sandbox_.logged("Staging path /private/var/mobile/.hidden looks wrong."));
+  EXPECT_TRUE(Exists(sandbox_.host("/private/var/backup/old")));
+  EXPECT_EQ(request("moveStagingToFinal:", XpcObject::String("/private/var/staging")), std::vector<XpcObject>{yes});
+  EXPECT_FALSE(Exists(sandbox_.host("/private/var/backup/old")));
+  EXPECT_TRUE(Exists(sandbox_.host("/private/var/backup/Media/photo.jpg")));
+  EXPECT_FALSE(Exists(sandbox_.host("/private/var/staging")));
+  EXPECT_TRUE(sandbox_.logged("Move the whole thing together."));
+}
+
+}  // namespace
+}  // namespace vtr::testing
