@@ -13,6 +13,45 @@
 
 #include "model/log_model.h"
 
+namespace vtr {
+
+void PrintTo(const Value& value, std::ostream* os) { *os << value.description(); }
+
+void PrintTo(const XpcObject& object, std::ostream* os) {
+  switch (object.type()) {
+    case XpcObject::Type::kDictionary: {
+      *os << "{";
+      const char* separator = "";
+      for (const auto& [key, item] : *object.dictionary()) {
+        *os << separator << '"' << key << "\": ";
+        PrintTo(item, os);
+        separator = ", ";
+      }
+      *os << "}";
+      break;
+    }
+    case XpcObject::Type::kArray: {
+      *os << "[";
+      const char* separator = "";
+      for (const XpcObject& item : *object.array()) {
+        *os << separator;
+        PrintTo(item, os);
+        separator = ", ";
+      }
+      *os << "]";
+      break;
+    }
+    case XpcObject::Type::kBool: *os << (*object.boolValue() ? "true" : "false"); break;
+    case XpcObject::Type::kInt64: *os << *object.int64Value(); break;
+    case XpcObject::Type::kUint64: *os << *object.uint64Value() << "u"; break;
+    case XpcObject::Type::kDouble: *os << *object.doubleValue(); break;
+    case XpcObject::Type::kString: *os << '"' << *object.string() << '"'; break;
+    default: *os << "<" << XpcTypeName(object.type()) << ">";
+  }
+}
+
+}  // namespace vtr
+
 namespace vtr::testing {
 
 TempDir::TempDir() {

@@ -8,6 +8,16 @@
 #include <vector>
 
 #include "platform/system_log.h"
+#include "platform/value.h"
+#include "xpc/xpc_object.h"
+
+namespace vtr {
+
+// How GoogleTest prints values in failure messages: their description.
+void PrintTo(const Value& value, std::ostream* os);
+void PrintTo(const XpcObject& object, std::ostream* os);
+
+}  // namespace vtr
 
 namespace vtr::testing {
 
