@@ -1,0 +1,40 @@
+// Content hashes of file-system items, as metadata records store them: the
+// SHA-1 digest of a regular file's bytes. Directories carry no hash.
+//
+// Reading is sequential in chunks of kFileHashChunkBytes through one buffer
+// per thread, so memory does not grow with the file; the pages read are
+// dropped from the page cache behind the reader (a manifest of a whole
+// device would otherwise push everything else out of the cache).
+//
+// Both functions may be called from several threads at once.
+#ifndef VTR_MODEL_FILE_HASH_H_
+#define VTR_MODEL_FILE_HASH_H_
+
+#include <cstddef>
+#include <optional>
+#include <string>
+
+#include "platform/value.h"
+
+namespace vtr {
+
+inline constexpr size_t kFileHashChunkBytes = 262144;
+inline constexpr size_t kFileHashDigestBytes = 20;
+
+// The 20-byte SHA-1 digest of the regular file at path (of no bytes for an
+// empty file), or nullopt on failure. The helper runs as root and hashes
+// whatever a client names, so only a regular file is read: a symbolic link at
+// the last component is not followed, and a fifo or device is refused after
+// a non-blocking open (it could hang the helper or have effects on open).
+// The file's access time is left as it was wherever the caller may ask for
+// that (its owner, or root). A file that cannot be opened, or is not a
+// regular file, logs "Cannot read
+// file %@"; a read error logs "Cannot read data from %@.".
+std::optional<Bytes> fileHash(const std::string& path);
+
+// Directories carry no hash: always nullopt, without touching the disk.
+std::optional<Bytes> directoryHash(const std::string& path);
+
+}  // namespace vtr
+
+#endif  // VTR_MODEL_FILE_HASH_H_

@@ -1,0 +1,166 @@
+// VTRFileMetadata: what the system records of one file-system item so that it
+// can lay the item down again elsewhere: its attributes, its extended
+// attributes, the SHA-1 of a regular file's content and a symbolic link's
+// target text.
+//
+// A record *is* its dictionary form, the shape manifests store:
+//   "VTRManifestFileAttributes"          dictionary: the file manager's
+//                                        attributes of the item itself
+//   "VTRManifestFileExtendedAttributes"  dictionary, name to data (empty when
+//                                        the item has none)
+//   "VTRManifestFileHash"                data: the SHA-1 of a regular file;
+//                                        empty for anything else and for a
+//                                        file that could not be read
+//   "VTRManifestSymbolicLinkTargetFile"  string: a link's target as stored;
+//                                        empty for anything else
+// Read from disk, the dictionary is built in that order and stops at the
+// first value that could not be had: without readable extended attributes a
+// record holds the attributes alone, and a link whose target could not be
+// read has no target entry. Readers go through the getters, which answer
+// nothing for a missing key or a value of the wrong kind, so a malformed
+// manifest entry gives absent values, never a failure.
+//
+// Failures are logged (one line each, texts as below) and answered with an
+// absent result. A record is immutable; records may be used from several
+// threads at once. Functions returning a Value answer nil for "absent".
+#ifndef VTR_MODEL_FILE_METADATA_H_
+#define VTR_MODEL_FILE_METADATA_H_
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/value.h"
+
+namespace vtr {
+
+inline constexpr char kVTRManifestFileAttributes[] = "VTRManifestFileAttributes";
+inline constexpr char kVTRManifestFileExtendedAttributes[] = "VTRManifestFileExtendedAttributes";
+inline constexpr char kVTRManifestFileHash[] = "VTRManifestFileHash";
+inline constexpr char kVTRManifestSymbolicLinkTargetFile[] = "VTRManifestSymbolicLinkTargetFile";
+
+// An extended attribute that differs from device to device by design and is
+// left out of comparisons.
+inline constexpr char kIgnoredExtendedAttribute[] = "com.orvane.glimd.dbRebuildUuid";
+
+// The codes of VTRFileMetadata::compareWith, in the order the checks run.
+enum VTRFileComparison : int {
+  kVTRFileOtherAbsent = 0,
+  kVTRFileTypeDiffers = 1,
+  kVTRFileHashDiffers = 2,
+  kVTRFileTargetDiffers = 3,
+  kVTRFileOwnershipDiffers = 4,
+  kVTRFileExtendedAttributesDiffer = 5,
+  kVTRFileSame = 6,
+};
+
+class VTRFileMetadata {
+ public:
+  // ---- Reading an item (class operations) ----
+
+  // The content hash of path for a record: nil with "File does not exist at
+  // %@" when nothing is there (links followed); empty data for a directory;
+  // otherwise the file's SHA-1, or empty data after "Maybe it's an Nimbrel
+  // file (%@)?" when it cannot be read.
+  static Value fileHashWithPath(const std::string& path);
+
+  // The item's attribute dictionary (a symbolic link is described itself),
+  // or nil after "Get file attributes failed for %@ with error - %@".
+  static Value fileAttributesWithPath(const std::string& path);
+
+  // The names of the item's extended attributes in the order the file system
+  // lists them (possibly none), or nullopt after "Could not extract extended
+  // attributes from %@." (the list size cannot be had) or "... File is
+  // expected to have extended attributes." (the list cannot be read). A
+  // symbolic link's own attributes are listed.
+  static std::optional<std::vector<std::string>> extendedAttributeKeysWithPath(const std::string& path);
+
+  // The value of one extended attribute of the item itself, as data; nil
+  // after "Could not extract extended file attributes from %@, returned %d"
+  // when it is not there (any more). If only the second read fails, "Coud not
+  // extract extended file attributes from %@. File is expected to have
+  // extended attributes." is logged and zero bytes of the first size returned.
+  static Value valueForExtendedAttributesKey(const std::string& key, const std::string& path);
+
+  // Every extended attribute of the item, name to data (an empty dictionary
+  // for none), or nil after "Could not get attribute keys from file %@". A
+  // name that disappears between listing and reading is left out.
+  static Value extendedAttributesWithPath(const std::string& path);
+
+  // The target text of the symbolic link at path, or nil after "Could not get
+  // destination of symbolic link %@ with error - %@".
+  static Value targetFileWithPath(const std::string& path);
+
+  // ---- Making records ----
+
+  // The record of the item at path, read from disk: nullopt after "Cannot
+  // get file attribute for %@" when its attributes cannot be read, and
+  // (without a further message) when an item that is not a link vanishes
+  // before it is hashed. An unreadable regular file still gives a record,
+  // with an empty hash.
+  static std::optional<VTRFileMetadata> initWithPath(const std::string& path);
+  static std::optional<VTRFileMetadata> fileMetadatatWithPath(const std::string& path) { return initWithPath(path); }
+
+  // A record holding dictionary as it is (shared, neither copied nor checked).
+  explicit VTRFileMetadata(Value dictionary) : dict_(std::move(dictionary)) {}
+  static VTRFileMetadata fileMetaDataWithMetadataDictionary(Value dictionary) {
+    return VTRFileMetadata(std::move(dictionary));
+  }
+
+  // ---- Using records ----
+
+  // Lays this record's attributes onto the item at path, never through a
+  // symbolic link at its last component:
+  // - a link record: owner and group (ids, read as 32-bit numbers) and mode
+  //   go onto the link itself; their results are not checked;
+  // - any other record: the allowed attributes are set (a link at path is
+  //   refused), on failure "Could not set file attributs at %@ with error -
+  //   %@, attributes = %@" and NO; then the protection class (which Linux
+  //   accepts without effect), on failure "Could not set file protection key
+  //   at %@ with error - %@, attributes = %@" and NO.
+  // Then each extended attribute in name order, stopping at the first that
+  // fails ("Got Non-string key" for a name that cannot be one, "Got non-data
+  // value", "Could not set extended attributes on %@"); attributes already on
+  // the item are kept. The answer is YES when the attributes step was done OR
+  // every extended attribute was set, so an item that is not a link answers
+  // YES despite an extended attribute that failed, and a link answers exactly
+  // whether its extended attributes were set. This asymmetry is deliberate.
+  bool restoreAttribuesToPath(const std::string& path) const;
+
+  // The first difference from other, as a VTRFileComparison code: other
+  // absent; type (an absent type here counts as different); content hash of
+  // a regular file; target of a link; owner id, group id or mode; extended
+  // attributes (kIgnoredExtendedAttribute left out on both sides; an absent
+  // dictionary counts as empty); else kVTRFileSame. Dates, sizes, names,
+  // counts and the protection class are not compared. Logs nothing.
+  int compareWith(const VTRFileMetadata* other) const;
+
+  // attributes less every key the restore may not set; nothing is added.
+  // Allowed: NSFileBusy, NSFileHFSCreatorCode, NSFileHFSTypeCode,
+  // NSFileImmutable, NSFileCreationDate, NSFileExtensionHidden,
+  // NSFileGroupOwnerAccountID, NSFileGroupOwnerAccountName,
+  // NSFileModificationDate, NSFileOwnerAccountID, NSFileOwnerAccountName,
+  // NSFilePosixPermissions.
+  static Dictionary fileAttributesAllowSet(const Dictionary& attributes);
+
+  // Typed views of the dictionary; null when missing or of another kind.
+  // Pointers stay valid as long as the record.
+  const Bytes* getHash() const;
+  const Dictionary* getFileAttributes() const;
+  const Dictionary* getExtendedAttributes() const;
+  const std::string* getFileType() const;
+  const std::string* getTargetFile() const;
+  // NSFileSize of a record whose type is NSFileTypeRegular; 0 for any other
+  // record, whatever size it holds.
+  uint64_t getFileSize() const;
+
+  const Value& dict() const { return dict_; }
+
+ private:
+  Value dict_;
+};
+
+}  // namespace vtr
+
+#endif  // VTR_MODEL_FILE_METADATA_H_

@@ -1,0 +1,153 @@
+// Using a file metadata record: laying it onto an item, comparing two.
+#include <sys/xattr.h>
+
+#include <array>
+#include <string_view>
+
+#include "model/file_metadata.h"
+#include "model/log.h"
+#include "platform/file_manager.h"
+
+namespace vtr {
+namespace {
+
+// The attributes a restore may set. The protection class is set in a step
+// of its own.
+constexpr std::array<std::string_view, 12> kAllowedToSet = {
+    kNSFileBusy,
+    kNSFileHFSCreatorCode,
+    kNSFileHFSTypeCode,
+    kNSFileImmutable,
+    kNSFileCreationDate,
+    kNSFileExtensionHidden,
+    kNSFileGroupOwnerAccountID,
+    kNSFileGroupOwnerAccountName,
+    kNSFileModificationDate,
+    kNSFileOwnerAccountID,
+    kNSFileOwnerAccountName,
+    kNSFilePosixPermissions,
+};
+
+// A number of the attributes read as a C int, the way the system reads ids
+// and modes off its number objects: missing or not a number reads as 0.
+int32_t Int32Attribute(const Dictionary* attributes, const char* key) {
+  const Value* value = attributes != nullptr ? attributes->find(key) : nullptr;
+  if (value == nullptr) return 0;
+  if (std::optional<int64_t> i = value->integer()) return static_cast<int32_t>(*i);
+  if (std::optional<uint64_t> u = value->unsignedInteger()) return static_cast<int32_t>(*u);
+  return 0;
+}
+
+// Sets the record's extended attributes in name order; false at the first
+// that cannot be set.
+bool SetExtendedAttributes(const Dictionary* attributes, const std::string& path) {
+  if (attributes == nullptr) return true;
+  for (const auto& [name, value] : *attributes) {
+    if (name.empty() || name.find('\0') != std::string::npos) {
+      VTRLog("Got Non-string key");
+      return false;
+    }
+    const Bytes* data = value.data();
+    if (data == nullptr) {
+      VTRLog("Got non-data value");
+      return false;
+    }
+    if (::lsetxattr(path.c_str(), name.c_str(), data->data(), data->size(), 0) != 0) {
+      VTRLog("Could not set extended attributes on %@", path);
+      return false;
+    }
+  }
+  return true;
+}
+
+// Extended attributes without the one that is not compared.
+Dictionary ComparableExtendedAttributes(const Dictionary* attributes) {
+  if (attributes == nullptr) return Dictionary();
+  std::vector<Dictionary::Entry> entries;
+  entries.reserve(attributes->size());
+  for (const auto& entry : *attributes) {
+    if (entry.first != kIgnoredExtendedAttribute) entries.push_back(entry);
+  }
+  return Dictionary(std::move(entries));
+}
+
+bool SameBytes(const Bytes* a, const Bytes* b) { return a != nullptr && b != nullptr && *a == *b; }
+bool SameString(const std::string* a, const std::string* b) { return a != nullptr && b != nullptr && *a == *b; }
+
+}  // namespace
+
+Dictionary VTRFileMetadata::fileAttributesAllowSet(const Dictionary& attributes) {
+  std::vector<Dictionary::Entry> allowed;
+  for (const auto& entry : attributes) {
+    for (std::string_view key : kAllowedToSet) {
+      if (entry.first == key) allowed.push_back(entry);
+    }
+  }
+  return Dictionary(std::move(allowed));
+}
+
+bool VTRFileMetadata::restoreAttribuesToPath(const std::string& path) const {
+  const Dictionary* attributes = getFileAttributes();
+  const std::string* type = getFileType();
+  bool attributesSet = false;
+  if (type != nullptr && *type == kNSFileTypeSymbolicLink) {
+    (void)ChangeOwnerOfItem(path, static_cast<uid_t>(Int32Attribute(attributes, kNSFileOwnerAccountID)),
+                            static_cast<gid_t>(Int32Attribute(attributes, kNSFileGroupOwnerAccountID)));
+    // Linux links have no mode of their own; the failure is expected.
+    (void)ChangeModeOfItem(path, static_cast<mode_t>(Int32Attribute(attributes, kNSFilePosixPermissions)) & 07777);
+  } else {
+    const Dictionary allowed = attributes != nullptr ? fileAttributesAllowSet(*attributes) : Dictionary();
+    Status set = SetAttributes(allowed, path, LinkAtPath::kRefuse);
+    if (!set.ok()) {
+      VTRLog("Could not set file attributs at %@ with error - %@, attributes = %@", path, set.error(),
+             Value::DictionaryOf(allowed));
+      return false;
+    }
+    const Value* protection = attributes != nullptr ? attributes->find(kNSFileProtectionKey) : nullptr;
+    Dictionary protectionOnly;
+    if (protection != nullptr) protectionOnly = Dictionary({{kNSFileProtectionKey, *protection}});
+    set = SetAttributes(protectionOnly, path, LinkAtPath::kRefuse);
+    if (!set.ok()) {
+      VTRLog("Could not set file protection key at %@ with error - %@, attributes = %@", path, set.error(),
+             protection != nullptr ? *protection : Value());
+      return false;
+    }
+    attributesSet = true;
+  }
+  const bool extendedAttributesSet = SetExtendedAttributes(getExtendedAttributes(), path);
+  return attributesSet || extendedAttributesSet;
+}
+
+int VTRFileMetadata::compareWith(const VTRFileMetadata* other) const {
+  if (other == nullptr) return kVTRFileOtherAbsent;
+  const std::string* type = getFileType();
+  if (!SameString(type, other->getFileType())) return kVTRFileTypeDiffers;
+  if (*type == kNSFileTypeRegular && !SameBytes(getHash(), other->getHash())) return kVTRFileHashDiffers;
+  if (*type == kNSFileTypeSymbolicLink && !SameString(getTargetFile(), other->getTargetFile())) {
+    return kVTRFileTargetDiffers;
+  }
+
+  // Only ownership and mode count. The protection class is tolerated: the
+  // walk runs over this record's keys, so a class present here never makes
+  // the records differ.
+  if (const Dictionary* attributes = getFileAttributes()) {
+    const Dictionary* theirs = other->getFileAttributes();
+    for (const char* key : {kNSFileGroupOwnerAccountID, kNSFileOwnerAccountID, kNSFilePosixPermissions}) {
+      const Value* mine = attributes->find(key);
+      if (mine == nullptr) continue;
+      const Value* their = theirs != nullptr ? theirs->find(key) : nullptr;
+      if (their == nullptr || !(*mine == *their)) return kVTRFileOwnershipDiffers;
+    }
+  }
+
+  const Dictionary mine = ComparableExtendedAttributes(getExtendedAttributes());
+  const Dictionary theirs = ComparableExtendedAttributes(other->getExtendedAttributes());
+  if (mine.size() != theirs.size()) return kVTRFileExtendedAttributesDiffer;
+  for (const auto& [name, value] : mine) {
+    const Value* their = theirs.find(name);
+    if (their == nullptr || !SameBytes(value.data(), their->data())) return kVTRFileExtendedAttributesDiffer;
+  }
+  return kVTRFileSame;
+}
+
+}  // namespace vtr

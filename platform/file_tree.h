@@ -1,0 +1,56 @@
+// Building blocks of the file manager's tree operations, working relative to
+// open directory descriptors so that no path under someone else's control is
+// resolved twice. Used by file_manager.h's implementation; not meant for
+// callers outside the platform layer.
+#ifndef VTR_PLATFORM_FILE_TREE_H_
+#define VTR_PLATFORM_FILE_TREE_H_
+
+#include <sys/types.h>
+
+#include <string>
+#include <vector>
+
+#include "platform/result.h"
+#include "platform/unique_fd.h"
+
+namespace vtr {
+
+// The parent directory of path, opened (following links in it, as any path
+// resolution does), and the last component. Fails with EINVAL for a path
+// whose last component is empty, "." or "..", and for "/".
+struct ParentAndName {
+  UniqueFd parent;
+  std::string name;
+};
+Result<ParentAndName> OpenParent(const std::string& path);
+
+// The names in the directory open as dirFd, without "." and "..", in the
+// order the file system gives them. dirFd stays open and is not moved.
+Result<std::vector<std::string>> DirectoryEntryNames(int dirFd, const std::string& pathForErrors);
+
+// Changes the mode of the entry name of dirFd without following a symbolic
+// link there (fchmodat2 with AT_SYMLINK_NOFOLLOW; on kernels without it, the
+// C library's fchmodat, which needs /proc for this).
+Status ChangeModeAt(int dirFd, const std::string& name, mode_t mode, const std::string& pathForErrors);
+
+// How ReplicateItem makes the files of the copy.
+enum class Replication {
+  kCopy,      // new files with the source's data, mode, owner, times and extended attributes
+  kHardLink,  // hard links of the source's files
+};
+
+// Replicates the entry srcName of srcDir as dstName in dstDir, which must
+// not exist. Directories are recreated entry by entry, with the source's
+// mode, owner, times and extended attributes; symbolic links are recreated
+// with their target text, owner and times; files (and special files) are
+// copied or hard-linked as the mode says. Nothing is followed. Ownership
+// that the caller may not give (EPERM when not root) and extended attributes
+// that the destination cannot hold are passed over. On failure, whatever was
+// made at dstName is removed again. Nesting deeper than kMaxTreeDepth fails
+// with ELOOP.
+Status ReplicateItem(int srcDir, const std::string& srcName, int dstDir, const std::string& dstName,
+                     Replication mode, const std::string& srcPath, const std::string& dstPath);
+
+}  // namespace vtr
+
+#endif  // VTR_PLATFORM_FILE_TREE_H_

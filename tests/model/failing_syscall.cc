@@ -1,0 +1,71 @@
+#include "tests/model/failing_syscall.h"
+
+#include <linux/audit.h>
+#include <linux/filter.h>
+#include <linux/seccomp.h>
+#include <sys/prctl.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstddef>
+
+namespace vtr::testing {
+namespace {
+
+#if defined(__x86_64__)
+constexpr uint32_t kAuditArch = AUDIT_ARCH_X86_64;
+#elif defined(__aarch64__)
+constexpr uint32_t kAuditArch = AUDIT_ARCH_AARCH64;
+#else
+constexpr uint32_t kAuditArch = 0;
+#endif
+
+bool InstallFilter(const std::vector<long>& numbers, int error) {
+  // arch check, then one comparison per call; a match jumps to the last
+  // instruction, which fails the call.
+  const size_t n = numbers.size();
+  std::vector<struct sock_filter> filter = {
+      BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(struct seccomp_data, arch)),
+      BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, kAuditArch, 1, 0),
+      BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW),
+      BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(struct seccomp_data, nr)),
+  };
+  for (size_t i = 0; i < n; ++i) {
+    filter.push_back(BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, static_cast<uint32_t>(numbers[i]),
+                              static_cast<uint8_t>(n - i), 0));
+  }
+  filter.push_back(BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW));
+  filter.push_back(BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ERRNO | (static_cast<uint32_t>(error) & SECCOMP_RET_DATA)));
+  struct sock_fprog program = {static_cast<unsigned short>(filter.size()), filter.data()};
+  return ::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) == 0 &&
+         ::prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &program, 0, 0) == 0;
+}
+
+}  // namespace
+
+bool CanFailSyscalls() { return kAuditArch != 0; }
+
+std::string RunWithFailingSyscalls(const std::vector<long>& numbers, int error,
+                                   const std::function<std::string()>& body) {
+  int fds[2];
+  if (::pipe(fds) != 0) return "<pipe failed>";
+  const pid_t pid = ::fork();
+  if (pid < 0) return "<fork failed>";
+  if (pid == 0) {
+    ::close(fds[0]);
+    if (!InstallFilter(numbers, error)) ::_exit(3);
+    const std::string result = body();
+    ::_exit(::write(fds[1], result.data(), result.size()) == static_cast<ssize_t>(result.size()) ? 0 : 2);
+  }
+  ::close(fds[1]);
+  std::string result;
+  char buffer[512];
+  for (ssize_t n; (n = ::read(fds[0], buffer, sizeof buffer)) > 0;) result.append(buffer, static_cast<size_t>(n));
+  ::close(fds[0]);
+  int status = 0;
+  if (::waitpid(pid, &status, 0) != pid) return "<waitpid failed>";
+  if (!WIFEXITED(status) || WEXITSTATUS(status) != 0) return "<child failed, status " + std::to_string(status) + ">";
+  return result;
+}
+
+}  // namespace vtr::testing
