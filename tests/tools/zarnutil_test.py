@@ -1,0 +1,197 @@
+#!/usr/bin/env python3
+"""Drives zarnutil on sparse disk images and reads the header bytes it writes
+independently (struct, zlib, uuid) to compare them with the layout."""
+import json
+import os
+import struct
+import subprocess
+import sys
+import tempfile
+import unittest
+import uuid
+import zlib
+
+BIN = None
+
+CRC_KIND = bytes.fromhex("6a9088cf8afd630ae351e24887e0b98b")
+HFS_PLUS = bytes.fromhex("48465300000011aaaa1100306543ecac")
+GIB = 1 << 30
+MIB = 1 << 20
+
+
+def run(*args):
+    return subprocess.run([os.path.join(BIN, "zarnutil"), *args], capture_output=True, text=True)
+
+
+def read_at(path, offset, length=4096):
+    with open(path, "rb") as f:
+        f.seek(offset)
+        return f.read(length)
+
+
+def write_at(path, offset, data):
+    with open(path, "r+b") as f:
+        f.seek(offset)
+        f.write(data)
+
+
+def crc_of(header):
+    return zlib.crc32(header[:44] + b"\0\0\0\0" + header[48:])
+
+
+def restamp(header):
+    header = bytearray(header)
+    struct.pack_into("<I", header, 44, crc_of(bytes(header)))
+    return bytes(header)
+
+
+class ZarnutilTest(unittest.TestCase):
+    def setUp(self):
+        self.dir = tempfile.TemporaryDirectory()
+        self.image = os.path.join(self.dir.name, "disk.img")
+        with open(self.image, "wb") as f:
+            f.truncate(16 * GIB)
+
+    def tearDown(self):
+        self.dir.cleanup()
+
+    def create(self, *options):
+        result = run(*options, "create", self.image)
+        self.assertEqual(result.returncode, 0, result.stderr)
+        return read_at(self.image, 0)
+
+    def test_create_writes_the_prescribed_header_twice(self):
+        h = self.create()
+        self.assertEqual(h[0:16], CRC_KIND)
+        self.assertNotEqual(h[16:32], bytes(16))
+        media, count, crc, flags = struct.unpack_from("<QIIQ", h, 32)
+        self.assertEqual((media, count, flags), (16 * GIB, 1, 0))
+        self.assertEqual(crc, crc_of(h))
+        self.assertEqual(h[56:512], bytes(456))
+        entry = h[512:640]
+        self.assertEqual(entry[0:16], HFS_PLUS)
+        self.assertNotIn(entry[16:32], (bytes(16), h[16:32]))
+        begin, end, attributes = struct.unpack_from("<QQQ", entry, 32)
+        self.assertEqual((begin, end, attributes), (24576, 24576 + 1016 * 16 * MIB, 0))
+        self.assertEqual(entry[56:128], "Zarn".encode("utf-16-le") + bytes(64))
+        self.assertEqual(h[640:2048], bytes(1408))
+        chunk_map = struct.unpack_from("<1024H", h, 2048)
+        self.assertEqual(chunk_map[0], 0xF000)
+        self.assertEqual(list(chunk_map[1:1017]), list(range(1016)))
+        self.assertEqual(set(chunk_map[1017:]), {0xF111})
+        # The backup copy: the last block of chunk 0.
+        self.assertEqual(read_at(self.image, 16 * MIB - 4096), h)
+
+    def test_show_reads_back_what_create_wrote(self):
+        h = self.create()
+        result = run("show", self.image, "--json")
+        self.assertEqual(result.returncode, 0, result.stderr)
+        shown = json.loads(result.stdout)
+        self.assertEqual(shown["media_size"], 16 * GIB)
+        self.assertEqual(shown["media_identity"], str(uuid.UUID(bytes=h[16:32])))
+        self.assertEqual(shown["partition_count"], 1)
+        self.assertEqual(shown["crc"], struct.unpack_from("<I", h, 44)[0])
+        self.assertEqual(shown["flags"], 0)
+        self.assertEqual(shown["chunk_map"], list(struct.unpack_from("<1024H", h, 2048)))
+        self.assertEqual(shown["partitions"], [{
+            "index": 0, "type": "48465300-0000-11aa-aa11-00306543ecac",
+            "identity": str(uuid.UUID(bytes=h[528:544])), "begin": 24576,
+            "end": 24576 + 1016 * 16 * MIB, "attributes": 0, "name": "Zarn"}])
+        text = run("show", self.image).stdout
+        self.assertIn("media size:      17179869184 (16 GiB)", text)
+        self.assertIn('"Zarn"', text)
+
+    def test_check_and_the_backup_copy(self):
+        h = self.create()
+        self.assertEqual(run("check", self.image).returncode, 0)
+        # A corrupt main copy: the backup is read, silently.
+        write_at(self.image, 100, b"\xff")
+        result = run("check", self.image)
+        self.assertEqual((result.returncode, result.stderr), (0, ""))
+        # A consistent CRC over an inconsistent map, in both copies.
+        damaged = bytearray(h)
+        struct.pack_into("<H", damaged, 2048 + 2 * 10, 0xF111)
+        damaged = restamp(damaged)
+        write_at(self.image, 0, damaged)
+        write_at(self.image, 16 * MIB - 4096, damaged)
+        result = run("check", self.image)
+        self.assertEqual((result.returncode, result.stderr), (1, "zarn: partition 0 missing chunk 0x0009\n"))
+        # Both copies corrupt.
+        write_at(self.image, 200, b"\xff")
+        write_at(self.image, 16 * MIB - 4096 + 200, b"\xff")
+        result = run("check", self.image)
+        self.assertEqual((result.returncode, result.stderr), (1, "zarn: media header corrupt\n"))
+
+    def test_repair_strict_and_lenient(self):
+        h = self.create()
+        result = run("repair", "--strict", self.image)
+        self.assertEqual(result.returncode, 1)
+        self.assertEqual(result.stderr, "zarn: partition 0 start/end not in order\nzarn: partition table corrupt\n")
+        self.assertEqual(read_at(self.image, 0), h)  # nothing written
+        result = run("repair", self.image)
+        self.assertEqual(result.returncode, 0, result.stderr)
+        self.assertEqual(result.stderr.count("not assigned to valid partition\n"), 1023)
+        repaired = read_at(self.image, 0)
+        self.assertEqual(struct.unpack_from("<I", repaired, 40)[0], 0)
+        self.assertEqual(struct.unpack_from("<I", repaired, 44)[0], crc_of(repaired))
+        self.assertEqual(read_at(self.image, 16 * MIB - 4096), repaired)
+        self.assertEqual(run("check", self.image).returncode, 0)
+
+    def test_export_and_map(self):
+        self.create()
+        result = run("export", self.image, "--json")
+        self.assertEqual(result.returncode, 0, result.stderr)
+        exported = json.loads(result.stdout)
+        self.assertEqual(set(exported), {"media_identity", "partitions"})
+        (partition,) = exported["partitions"]
+        self.assertEqual(set(partition), {"index", "name", "type", "identity", "size", "flags", "extents"})
+        self.assertEqual(partition["extents"], [{"offset": 16 * MIB, "length": 1016 * 16 * MIB}])
+        self.assertEqual(partition["size"], 1016 * 16 * MIB)
+
+        lines = run("map", self.image).stdout.splitlines()
+        grid = [line for line in lines if line.startswith("0x")]
+        self.assertEqual(len(grid), 32)
+        self.assertTrue(all(len(line.split()[1]) == 32 for line in grid))
+        self.assertTrue(grid[0].endswith("#" + "A" * 31))
+        self.assertTrue(grid[-1].endswith("A" * 25 + "." * 7))
+        self.assertIn('A partition 0 "Zarn": 1016 chunks in 1 run', "\n".join(lines))
+        self.assertIn("free: 7 chunks (112 MiB) in 1 run", lines)
+
+    def test_hostile_names_stay_valid_json(self):
+        h = bytearray(self.create())
+        units = [ord('"'), ord("\\"), 0x01, 0xE9, 0xD800, ord("Z")]
+        h[512 + 56:512 + 128] = struct.pack("<%dH" % len(units), *units).ljust(72, b"\0")
+        h = restamp(h)
+        write_at(self.image, 0, h)
+        expected = '"\\\x01\u00e9\ufffd\ufffd\ufffdZ'
+        for command in ("show", "export"):
+            result = run(command, self.image, "--json")
+            self.assertEqual(result.returncode, 0, result.stderr)
+            self.assertEqual(json.loads(result.stdout)["partitions"][0]["name"], expected, command)
+        self.assertIn('"\\"\\\\\\u0001', run("show", self.image).stdout)
+
+    def test_block_sizes(self):
+        h = self.create("--block-size", "16384")
+        begin = struct.unpack_from("<Q", h, 512 + 32)[0]
+        self.assertEqual(begin, 2 * 16384 + 16384)
+        self.assertEqual(read_at(self.image, 16 * MIB - 16384), h)
+        self.assertEqual(run("--block-size=16384", "check", self.image).returncode, 0)
+        for size, message in (("4095", "zarn: media block size too small\n"),
+                              ("16385", "zarn: media block size too large\n")):
+            result = run("--block-size", size, "create", self.image)
+            self.assertEqual((result.returncode, result.stderr), (1, message))
+
+    def test_usage(self):
+        self.assertEqual(run("--help").returncode, 0)
+        self.assertIn("usage: zarnutil", run("--help").stdout)
+        for args in ((), ("frobnicate", self.image), ("show",), ("show", "--strict", self.image),
+                     ("--block-size", "0", "show", self.image), ("check", self.image, self.image)):
+            self.assertEqual(run(*args).returncode, 2, args)
+        result = run("show", self.dir.name)
+        self.assertEqual(result.returncode, 1)
+        self.assertIn("zarnutil: ", result.stderr)
+
+
+if __name__ == "__main__":
+    BIN = sys.argv.pop(1)
+    unittest.main()
