@@ -28,7 +28,8 @@ struct PlistLimits {
   // Largest expanded result: nodes reached counting every reference to a
   // shared object each time it is reached, and string/data bytes likewise.
   // 0 derives a bound from the input size (a multiple of it, with a floor),
-  // which no file written by an honest writer comes near.
+  // which no file written by an honest writer comes near. The binary reader
+  // derives 16 times the input size, at least 2^20 nodes and 64 MiB.
   uint64_t maxExpandedNodes = 0;
   uint64_t maxExpandedBytes = 0;
 };
@@ -71,7 +72,9 @@ Status WritePropertyListFile(const std::string& path, const Value& value, PlistF
 // needed to keep keys unique stay in memory. Output is deterministic: the
 // same entries added in the same order give the same bytes. Entries keep the
 // order they were added in; adding a key again replaces its value (the
-// earlier objects stay in the file, unreferenced).
+// earlier objects stay in the file, unreferenced). Not knowing the number of
+// objects in advance, it writes 4-byte references: at most 2^32 objects, and
+// add() fails past that.
 class BinaryPlistDictionaryWriter {
  public:
   // out must outlive the writer.
@@ -80,6 +83,9 @@ class BinaryPlistDictionaryWriter {
   BinaryPlistDictionaryWriter(const BinaryPlistDictionaryWriter&) = delete;
   BinaryPlistDictionaryWriter& operator=(const BinaryPlistDictionaryWriter&) = delete;
 
+  // Writes the entry's objects. A value that cannot be written (nil, text
+  // that is not UTF-8) fails this call only; the writer stays usable. After
+  // a stream error every later call fails too.
   Status add(std::string_view key, const Value& value);
   // Writes the top dictionary, the offset table and the trailer, and flushes
   // the stream. No add() may follow.
