@@ -1,15 +1,16 @@
 #include "model/log_model.h"
 
-#include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <cstring>
 #include <optional>
+#include <utility>
 #include <vector>
 
 #include "platform/file_dates.h"
+#include "platform/file_manager.h"
 #include "platform/make_directories.h"
 #include "platform/remove_item.h"
 
@@ -17,6 +18,9 @@ namespace vtr {
 namespace {
 
 constexpr char kProbeName[] = "testWritability.log";
+
+// Where this thread's messages go instead of being written (ScopedLogDiversion).
+thread_local std::vector<std::string>* t_divertedMessages = nullptr;
 
 // "~/x" becomes "$HOME/x"; other paths stay as they are.
 std::string ExpandTilde(const std::string& path) {
@@ -47,19 +51,6 @@ bool ProbeWritable(const std::string& directory) {
   return written;
 }
 
-// Entry names of a directory in listing order, or nullopt when unreadable.
-std::optional<std::vector<std::string>> ListDirectory(const std::string& directory) {
-  DIR* dir = ::opendir(directory.c_str());
-  if (dir == nullptr) return std::nullopt;
-  std::vector<std::string> names;
-  while (struct dirent* entry = ::readdir(dir)) {
-    if (std::strcmp(entry->d_name, ".") == 0 || std::strcmp(entry->d_name, "..") == 0) continue;
-    names.emplace_back(entry->d_name);
-  }
-  ::closedir(dir);
-  return names;
-}
-
 }  // namespace
 
 VTRLogModel& VTRLogModel::sharedInstance() {
@@ -71,6 +62,10 @@ VTRLogModel::VTRLogModel(std::shared_ptr<SystemLog> systemLog, std::shared_ptr<C
     : systemLog_(std::move(systemLog)), clock_(std::move(clock)) {}
 
 void VTRLogModel::logMessage(std::string_view message) {
+  if (t_divertedMessages != nullptr) {
+    t_divertedMessages->emplace_back(message);
+    return;
+  }
   std::shared_ptr<SystemLog> systemLog;
   {
     std::lock_guard<std::mutex> lock(mutex_);
@@ -111,7 +106,8 @@ bool VTRLogModel::enableLogToFilesUnder(const std::string& directory, const std:
     clock = clock_;
   }
   const Date cutoff{clock->now().secondsSince2001 - static_cast<double>(expireDays) * 86400.0};
-  if (std::optional<std::vector<std::string>> names = ListDirectory(directory)) {
+  // A directory that cannot be listed is not swept.
+  if (Result<std::vector<std::string>> names = ContentsOfDirectory(directory); names.ok()) {
     for (const std::string& name : *names) {
       const std::string fullPath = Format("%@/%@", directory, name);
       systemLogOnly(Format("Checking existing log file (full path) %@ against %@", fullPath, cutoff));
@@ -160,5 +156,10 @@ void VTRLogModel::setClock(std::shared_ptr<Clock> clock) {
   std::lock_guard<std::mutex> lock(mutex_);
   clock_ = std::move(clock);
 }
+
+ScopedLogDiversion::ScopedLogDiversion(std::vector<std::string>* messages)
+    : previous_(std::exchange(t_divertedMessages, messages)) {}
+
+ScopedLogDiversion::~ScopedLogDiversion() { t_divertedMessages = previous_; }
 
 }  // namespace vtr

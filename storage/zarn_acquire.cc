@@ -30,14 +30,7 @@ int zarnAcquireHeader(const ZarnMedium& medium, const ZarnMediaProperties* props
     ZarnPrint("zarn: block count acquisition error\n");
     return -1;
   }
-  if (props == nullptr) {
-    ZarnPrint("zarn: NULL media properties\n");
-    return -1;
-  }
-  if (header == nullptr) {
-    ZarnPrint("zarn: NULL header buffer\n");
-    return -1;
-  }
+  if (!ZarnArgumentsPresent(props, header)) return -1;
   // One device block; never smaller than a header, so that copying the
   // header out of a small block reads zeros rather than past the buffer.
   std::vector<uint8_t> block(std::max<size_t>(*blockSize, kZarnHeaderSize), 0);

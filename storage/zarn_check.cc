@@ -85,14 +85,7 @@ bool CheckMediumSlots(const ZarnMediaProperties& props, ZarnHeaderView h, uint32
 }  // namespace
 
 int zarnCheckHeader(const ZarnMediaProperties* props, const uint8_t* header) {
-  if (props == nullptr) {
-    ZarnPrint("zarn: NULL media properties\n");
-    return -1;
-  }
-  if (header == nullptr) {
-    ZarnPrint("zarn: NULL header buffer\n");
-    return -1;
-  }
+  if (!ZarnArgumentsPresent(props, header)) return -1;
   const ZarnHeaderView h(header);
   if (!h.hasKnownType()) {
     ZarnPrint("zarn: media header mismatch\n");

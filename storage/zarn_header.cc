@@ -24,14 +24,7 @@ int CompareWithCrcKind(const uint8_t* header) {
 }  // namespace
 
 int zarnCreateHeaderWithFlags(const ZarnMediaProperties* props, uint8_t* header, uint64_t flags) {
-  if (props == nullptr) {
-    ZarnPrint("zarn: NULL media properties\n");
-    return -1;
-  }
-  if (header == nullptr) {
-    ZarnPrint("zarn: NULL header buffer\n");
-    return -1;
-  }
+  if (!ZarnArgumentsPresent(props, header)) return -1;
   std::fill_n(header, kZarnHeaderSize, uint8_t{0});
   ZarnHeaderEditor h(header);
   h.setType(kZarnTypeWithCrc);

@@ -104,14 +104,7 @@ void ReclaimStraySlots(const ZarnMediaProperties& props, ZarnHeaderEditor h, uin
 }  // namespace
 
 int zarnRepairHeader(const ZarnMediaProperties* props, uint8_t* header, int strict) {
-  if (props == nullptr) {
-    ZarnPrint("zarn: NULL media properties\n");
-    return -1;
-  }
-  if (header == nullptr) {
-    ZarnPrint("zarn: NULL header buffer\n");
-    return -1;
-  }
+  if (!ZarnArgumentsPresent(props, header)) return -1;
   ZarnHeaderEditor h(header);
   if (!h.hasKnownType()) {
     ZarnPrint("zarn: media header mismatch\n");
