@@ -14,6 +14,7 @@
 #include <mutex>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "platform/clock.h"
 #include "platform/format.h"
@@ -81,6 +82,22 @@ class VTRLogModel {
   FILE* logFP_ = nullptr;
   std::shared_ptr<SystemLog> systemLog_;
   std::shared_ptr<Clock> clock_;
+};
+
+// While alive, what is logged on the thread that made it is appended to
+// *messages instead of being written; the owner logs the messages later with
+// logMessage(). Work moved to a helper thread thereby logs at the point where
+// doing it in sequence would have. Diversions nest: the innermost one
+// collects until it ends. Must end on the thread that made it.
+class ScopedLogDiversion {
+ public:
+  explicit ScopedLogDiversion(std::vector<std::string>* messages);
+  ~ScopedLogDiversion();
+  ScopedLogDiversion(const ScopedLogDiversion&) = delete;
+  ScopedLogDiversion& operator=(const ScopedLogDiversion&) = delete;
+
+ private:
+  std::vector<std::string>* previous_;
 };
 
 }  // namespace vtr
