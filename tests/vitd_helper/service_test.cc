@@ -87,8 +87,8 @@ TEST_F(ServiceTest, OnlyAnEntitledClientIsServed) {
 }
 
 TEST_F(ServiceTest, APeerThatExecsAnotherProgramIsNoLongerEntitled) {
-  // A child of this (entitled) test connects, then execs a shell, which sends
-  // the request: same process, another executable.
+  // A child of this (entitled) test connects, is served once, then execs a
+  // shell, which sends the request: same process, another executable.
   Result<XpcBytes> frame = EncodeFrame(Request({{"prepareWorkContainer:", XpcObject::String("/private/var/X")}}));
   ASSERT_TRUE(frame.ok());
   TempDir dir;
@@ -99,6 +99,12 @@ TEST_F(ServiceTest, APeerThatExecsAnotherProgramIsNoLongerEntitled) {
   if (child == 0) {
     Result<XpcClient> client = XpcClient::Connect(socketPath);
     if (!client.ok()) ::_exit(1);
+    // A first request, answered, proves that the helper has accepted the
+    // connection and recorded who is behind it before the exec.
+    if (!client->send(Request({{"removeWorkContainer:", XpcObject::String("/private/var/none")}})).ok() ||
+        !client->receive(std::chrono::seconds(10)).ok()) {
+      ::_exit(2);
+    }
     // dup2 onto itself would keep close-on-exec; clear it either way.
     if (client->fd() != 3) ::dup2(client->fd(), 3);
     ::fcntl(3, F_SETFD, 0);
