@@ -1,0 +1,47 @@
+#include "model/manifest_file.h"
+
+#include <sys/stat.h>
+
+#include "platform/file_manager.h"
+
+namespace vtr {
+
+Result<std::unique_ptr<ManifestFileWriter>> ManifestFileWriter::Create(const std::string& path, mode_t mode) {
+  Result<AtomicFile> file = AtomicFile::Create(path, mode);
+  if (!file.ok()) return file.error();
+  struct stat st;
+  if (::fstat(file->fd(), &st) != 0) return Error::FromErrno(path);
+  return std::unique_ptr<ManifestFileWriter>(
+      new ManifestFileWriter(std::move(*file), static_cast<int64_t>(st.st_dev), static_cast<uint64_t>(st.st_ino)));
+}
+
+ManifestFileWriter::ManifestFileWriter(AtomicFile file, int64_t device, uint64_t inode)
+    : file_(std::move(file)), device_(device), inode_(inode), stream_(file_.fd()), writer_(&stream_) {}
+
+bool ManifestFileWriter::isOwnFile(const VTRFileMetadata& record) const {
+  const Dictionary* attributes = record.getFileAttributes();
+  if (attributes == nullptr) return false;
+  const Value* device = attributes->find(kNSFileSystemNumber);
+  const Value* inode = attributes->find(kNSFileSystemFileNumber);
+  return device != nullptr && inode != nullptr && device->integer() == device_ && inode->unsignedInteger() == inode_;
+}
+
+Status ManifestFileWriter::add(const std::string& key, const VTRFileMetadata& record) {
+  if (failure_.ok() && !isOwnFile(record)) failure_ = writer_.add(key, record.dict());
+  return failure_;
+}
+
+VTRManifest::Handler ManifestFileWriter::handler() {
+  return [this](const VTRFileMetadata& record, const std::string& key) {
+    (void)add(key, record);
+    return true;
+  };
+}
+
+Status ManifestFileWriter::commit() {
+  if (failure_.ok()) failure_ = writer_.finish();
+  if (failure_.ok()) failure_ = file_.commit();
+  return failure_;
+}
+
+}  // namespace vtr

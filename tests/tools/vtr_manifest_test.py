@@ -1,0 +1,266 @@
+#!/usr/bin/env python3
+"""Drives vtr-manifest on trees made here and checks what it writes against an
+independent reading of the same tree: plistlib for the file, os.lstat,
+os.listxattr, hashlib.sha1 and os.readlink for the items, pwd and grp for the
+account names."""
+import datetime
+import grp
+import hashlib
+import json
+import os
+import plistlib
+import pwd
+import shutil
+import socket
+import stat
+import subprocess
+import sys
+import tempfile
+import unittest
+
+BIN = None
+EPOCH_2001 = datetime.datetime(2001, 1, 1)
+
+TYPES = {
+    stat.S_IFREG: "NSFileTypeRegular",
+    stat.S_IFDIR: "NSFileTypeDirectory",
+    stat.S_IFLNK: "NSFileTypeSymbolicLink",
+}
+
+
+def run(*args, timeout=120):
+    return subprocess.run([os.path.join(BIN, "vtr-manifest"), *args], capture_output=True, timeout=timeout)
+
+
+def make_tree(root):
+    """Every kind of item a client can plant: files around the 256 KiB read
+    size, extended attributes, links of all sorts, a fifo and a socket,
+    hidden and non-ASCII names, odd modes and owners."""
+    os.makedirs(os.path.join(root, "dir/sub/deeper"))
+    os.makedirs(os.path.join(root, ".hidden"))
+    sizes = {"empty": 0, "small": 10, "chunk": 262144, "chunk+1": 262145, "big": 3 << 20}
+    for name, size in sizes.items():
+        with open(os.path.join(root, "dir", name), "wb") as f:
+            f.write(os.urandom(size))
+    with open(os.path.join(root, "dir/sub/deeper/caf\u00e9 \u2603.txt"), "w") as f:
+        f.write("snow")
+    with open(os.path.join(root, ".hidden/.profile"), "w") as f:
+        f.write("x")
+    tagged = os.path.join(root, "dir/small")
+    os.setxattr(tagged, "user.one", b"\x00\x01binary")
+    os.setxattr(tagged, "user.empty", b"")
+    os.setxattr(os.path.join(root, "dir/sub"), "user.on-a-dir", b"d")
+    os.symlink("small", os.path.join(root, "dir/link-to-file"))
+    os.symlink("/etc", os.path.join(root, "dir/link-to-etc"))
+    os.symlink("../nowhere", os.path.join(root, "dir/dangling"))
+    os.symlink("sub", os.path.join(root, "dir/link-to-dir"))
+    os.mkfifo(os.path.join(root, "dir/fifo"))
+    with socket.socket(socket.AF_UNIX) as s:
+        s.bind(os.path.join(root, "dir/sock"))
+    os.chmod(os.path.join(root, "dir/chunk"), 0o4751)
+    if os.geteuid() == 0:
+        os.chown(os.path.join(root, "dir/empty"), 65534, 65534)
+        os.chown(os.path.join(root, "dir/big"), 54321, 54321)  # ids without names
+        os.link(os.path.join(root, "dir/big"), os.path.join(root, "hardlink"))
+
+
+def expected_keys(root, inclusive):
+    keys = {"/"} if inclusive else set()
+    for dirpath, dirnames, filenames in os.walk(root):
+        for name in dirnames + filenames:
+            path = os.path.join(dirpath, name)
+            if stat.S_IFMT(os.lstat(path).st_mode) in TYPES:
+                keys.add(path[len(root):])
+    return keys
+
+
+def seconds_since_2001(value):
+    return (value - EPOCH_2001).total_seconds()
+
+
+class CreateTest(unittest.TestCase):
+    def setUp(self):
+        self.tmp = tempfile.mkdtemp()
+        self.root = os.path.join(self.tmp, "tree")
+        make_tree(self.root)
+        self.out = os.path.join(self.tmp, "manifest.plist")
+
+    def tearDown(self):
+        shutil.rmtree(self.tmp)
+
+    def create(self, *extra):
+        result = run("create", self.root, "-o", self.out, *extra)
+        self.assertEqual(result.returncode, 0, result.stderr)
+        with open(self.out, "rb") as f:
+            return plistlib.load(f), result.stderr.decode()
+
+    def check_record(self, key, record):
+        path = self.root + ("" if key == "/" else key)
+        st = os.lstat(path)
+        attributes = record["VTRManifestFileAttributes"]
+        self.assertEqual(attributes["NSFileType"], TYPES[stat.S_IFMT(st.st_mode)])
+        self.assertEqual(attributes["NSFilePosixPermissions"], st.st_mode & 0o7777)
+        self.assertEqual(attributes["NSFileSize"], st.st_size)
+        self.assertEqual(attributes["NSFileReferenceCount"], st.st_nlink)
+        self.assertEqual(attributes["NSFileSystemFileNumber"], st.st_ino)
+        self.assertEqual(attributes["NSFileOwnerAccountID"], st.st_uid)
+        self.assertEqual(attributes["NSFileGroupOwnerAccountID"], st.st_gid)
+        try:
+            self.assertEqual(attributes["NSFileOwnerAccountName"], pwd.getpwuid(st.st_uid).pw_name)
+        except KeyError:
+            self.assertNotIn("NSFileOwnerAccountName", attributes)
+        try:
+            self.assertEqual(attributes["NSFileGroupOwnerAccountName"], grp.getgrgid(st.st_gid).gr_name)
+        except KeyError:
+            self.assertNotIn("NSFileGroupOwnerAccountName", attributes)
+        mtime = seconds_since_2001(attributes["NSFileModificationDate"]) + 978307200
+        self.assertAlmostEqual(mtime, st.st_mtime_ns / 1e9, delta=1e-5)
+
+        xattrs = {n: os.getxattr(path, n, follow_symlinks=False) for n in os.listxattr(path, follow_symlinks=False)}
+        self.assertEqual(record["VTRManifestFileExtendedAttributes"], xattrs)
+        if stat.S_ISREG(st.st_mode):
+            with open(path, "rb") as f:
+                self.assertEqual(record["VTRManifestFileHash"], hashlib.sha1(f.read()).digest())
+        else:
+            self.assertEqual(record["VTRManifestFileHash"], b"")
+        target = os.readlink(path) if stat.S_ISLNK(st.st_mode) else ""
+        self.assertEqual(record["VTRManifestSymbolicLinkTargetFile"], target)
+
+    def test_every_entry_matches_the_tree(self):
+        manifest, stderr = self.create("--inclusive")
+        self.assertEqual(set(manifest), expected_keys(self.root, inclusive=True))
+        for key, record in manifest.items():
+            with self.subTest(key=key):
+                self.check_record(key, record)
+        for special in ("fifo", "sock"):
+            self.assertIn(os.path.join(self.root, "dir", special) + " is special file. Leave it along", stderr)
+
+    def test_keys_relative_to_another_root_and_skips(self):
+        manifest, _ = self.create("--relative-to", self.tmp, "--skip", os.path.join(self.root, "dir/sub"),
+                                  "--skip", os.path.join(self.root, "di"))
+        keys = set(manifest)
+        self.assertIn("/tree/dir/small", keys)
+        self.assertNotIn("/tree/dir/sub", keys)
+        self.assertFalse(any(k.startswith("/tree/dir/sub/") for k in keys))
+        self.assertIn("/tree/dir/link-to-dir", keys)
+
+    def test_sequential_and_parallel_files_are_identical(self):
+        self.create("--jobs", "0")
+        with open(self.out, "rb") as f:
+            sequential = f.read()
+        self.create("--jobs", "4")
+        with open(self.out, "rb") as f:
+            self.assertEqual(f.read(), sequential)
+
+    def test_deep_nesting_is_reported_not_followed_forever(self):
+        fd = os.open(self.root, os.O_RDONLY)
+        try:
+            for _ in range(700):
+                os.mkdir("n", dir_fd=fd)
+                next_fd = os.open("n", os.O_RDONLY, dir_fd=fd)
+                os.close(fd)
+                fd = next_fd
+        finally:
+            os.close(fd)
+        manifest, stderr = self.create()
+        self.assertIn("/n" * 513, manifest)
+        self.assertNotIn("/n" * 514, manifest)
+        self.assertIn("not entered", stderr)
+
+    def test_unwritable_output_fails_and_writes_nothing(self):
+        result = run("create", self.root, "-o", os.path.join(self.tmp, "absent", "m.plist"))
+        self.assertEqual(result.returncode, 2)
+        self.assertFalse(os.path.exists(os.path.join(self.tmp, "absent")))
+
+
+class ShowAndCompareTest(unittest.TestCase):
+    def setUp(self):
+        self.tmp = tempfile.mkdtemp()
+        self.root = os.path.join(self.tmp, "tree")
+        make_tree(self.root)
+        self.out = os.path.join(self.tmp, "manifest.plist")
+        result = run("create", self.root, "-o", self.out)
+        self.assertEqual(result.returncode, 0, result.stderr)
+        with open(self.out, "rb") as f:
+            self.manifest = plistlib.load(f)
+
+    def tearDown(self):
+        shutil.rmtree(self.tmp)
+
+    def compare(self):
+        result = run("compare", self.out, self.root)
+        return result.returncode, sorted(result.stdout.decode().splitlines())
+
+    def test_text_and_json_show_every_entry(self):
+        text = run("show", self.out)
+        self.assertEqual(text.returncode, 0)
+        lines = text.stdout.decode().splitlines()
+        self.assertEqual(len(lines), len(self.manifest))
+        small = self.manifest["/dir/small"]
+        small_line = next(l for l in lines if l.endswith(" /dir/small xattrs=user.empty,user.one"))
+        self.assertTrue(small_line.startswith("- 0644 "))
+        self.assertIn(small["VTRManifestFileHash"].hex(), small_line)
+        self.assertTrue(any(l.startswith("l ") and l.endswith("/dir/link-to-etc -> /etc") for l in lines))
+
+        shown = json.loads(run("show", self.out, "--format", "json").stdout)
+        self.assertEqual(set(shown), set(self.manifest))
+        self.assertEqual(shown["/dir/small"]["VTRManifestFileHash"], small["VTRManifestFileHash"].hex())
+        self.assertEqual(shown["/dir/small"]["VTRManifestFileExtendedAttributes"]["user.one"], "0001" + b"binary".hex())
+
+        # XML carries dates to the whole second.
+        one = run("show", self.out, "--format", "xml", "--path", "/dir/small")
+        whole = {k: v.replace(microsecond=0) if isinstance(v, datetime.datetime) else v
+                 for k, v in small["VTRManifestFileAttributes"].items()}
+        self.assertEqual(plistlib.loads(one.stdout), {"/dir/small": dict(small, VTRManifestFileAttributes=whole)})
+        self.assertEqual(run("show", self.out, "--path", "/absent").returncode, 1)
+
+    def test_a_signed_manifests_payload_is_shown(self):
+        payload = {"Version": 3, "Info": {}, "App": [], "Backup": self.manifest,
+                   "AppData": {"com.example.app": {"Manifest": {"/Documents": self.manifest["/dir"]}}}}
+        signed = {"Version": 2, "Certificate": [b"not checked"], "Signature": b"",
+                  "Payload": plistlib.dumps(payload, fmt=plistlib.FMT_BINARY)}
+        path = os.path.join(self.tmp, "signed.plist")
+        with open(path, "wb") as f:
+            plistlib.dump(signed, f)
+        self.assertEqual(run("show", path).stdout, run("show", self.out).stdout)
+        app = run("show", path, "--container", "com.example.app").stdout.decode().splitlines()
+        self.assertEqual(len(app), 1)
+        self.assertTrue(app[0].endswith(" /Documents"))
+        self.assertEqual(run("show", path, "--container", "unknown").returncode, 2)
+
+    def test_compare_names_each_difference(self):
+        self.assertEqual(self.compare(), (0, []))
+        r = self.root
+        with open(os.path.join(r, "dir/small"), "ab") as f:
+            f.write(b"more")
+        os.chmod(os.path.join(r, "dir/empty"), 0o600)
+        os.setxattr(os.path.join(r, "dir/sub"), "user.on-a-dir", b"changed")
+        os.remove(os.path.join(r, "dir/link-to-file"))
+        os.symlink("elsewhere", os.path.join(r, "dir/link-to-file"))
+        os.remove(os.path.join(r, "dir/chunk"))
+        os.mkdir(os.path.join(r, "dir/chunk"))
+        os.remove(os.path.join(r, "dir/big"))
+        with open(os.path.join(r, "new"), "w") as f:
+            f.write("")
+        self.assertEqual(self.compare(), (1, [
+            "- not-in-manifest /new",
+            "0 missing-on-disk /dir/big",
+            "1 type-differs /dir/chunk",
+            "2 content-differs /dir/small",
+            "3 link-target-differs /dir/link-to-file",
+            "4 owner-or-mode-differs /dir/empty",
+            "5 xattrs-differ /dir/sub",
+        ]))
+
+    def test_usage_errors(self):
+        for args in ([], ["frobnicate"], ["create", self.root], ["show"], ["show", self.out, "--format", "yaml"],
+                     ["compare", self.out], ["create", self.root, "-o", self.out, "--jobs", "many"],
+                     ["show", self.out, "--skip", "/x"]):
+            with self.subTest(args=args):
+                self.assertEqual(run(*args).returncode, 64)
+        self.assertEqual(run("--help").returncode, 0)
+
+
+if __name__ == "__main__":
+    BIN = sys.argv.pop(1)
+    unittest.main()

@@ -1,0 +1,196 @@
+#include "tools/vtr-manifest/command_line.h"
+
+#include <charconv>
+
+namespace vtr::manifest_tool {
+namespace {
+
+using Command = CommandLine::Command;
+
+// Upper bound of --jobs: more threads than this only contend for the disk.
+constexpr unsigned kMaxJobs = 64;
+
+constexpr unsigned Bit(Command command) { return 1u << static_cast<unsigned>(command); }
+constexpr unsigned kWalking = Bit(Command::kCreate) | Bit(Command::kCompare);
+constexpr unsigned kReading = Bit(Command::kShow) | Bit(Command::kCompare);
+constexpr unsigned kAll = Bit(Command::kCreate) | Bit(Command::kShow) | Bit(Command::kCompare);
+
+WalkOptions& Walk(CommandLine& c) { return c.command == Command::kCreate ? c.create.walk : c.compare.walk; }
+ManifestSelection& Selection(CommandLine& c) {
+  return c.command == Command::kShow ? c.show.manifest : c.compare.manifest;
+}
+
+Status ParseJobs(const std::string& text, std::optional<unsigned>* jobs) {
+  unsigned n = 0;
+  const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), n);
+  if (error != std::errc() || end != text.data() + text.size() || n > kMaxJobs) {
+    return Error::Invalid("--jobs takes a number from 0 to " + std::to_string(kMaxJobs));
+  }
+  *jobs = n;
+  return Status::Ok();
+}
+
+Status ParseFormat(const std::string& text, ShowFormat* format) {
+  static const struct {
+    const char* name;
+    ShowFormat format;
+  } kFormats[] = {{"text", ShowFormat::kText}, {"json", ShowFormat::kJson}, {"xml", ShowFormat::kXml}};
+  for (const auto& f : kFormats) {
+    if (text == f.name) {
+      *format = f.format;
+      return Status::Ok();
+    }
+  }
+  return Error::Invalid("--format takes text, json or xml");
+}
+
+struct Option {
+  const char* name;
+  bool takesValue;
+  unsigned commands;  // the commands that accept it
+  Status (*apply)(CommandLine& c, const std::string& value);
+};
+
+const Option kOptions[] = {
+    {"--relative-to", true, kWalking,
+     [](CommandLine& c, const std::string& v) { Walk(c).relativeTo = v; return Status::Ok(); }},
+    {"--inclusive", false, kWalking,
+     [](CommandLine& c, const std::string&) { Walk(c).inclusive = true; return Status::Ok(); }},
+    {"--skip", true, kWalking,
+     [](CommandLine& c, const std::string& v) { Walk(c).skip.push_back(v); return Status::Ok(); }},
+    {"--jobs", true, kWalking, [](CommandLine& c, const std::string& v) { return ParseJobs(v, &Walk(c).jobs); }},
+    {"-o", true, Bit(Command::kCreate),
+     [](CommandLine& c, const std::string& v) { c.create.output = v; return Status::Ok(); }},
+    {"--format", true, Bit(Command::kShow),
+     [](CommandLine& c, const std::string& v) { return ParseFormat(v, &c.show.format); }},
+    {"--path", true, Bit(Command::kShow),
+     [](CommandLine& c, const std::string& v) { c.show.path = v; return Status::Ok(); }},
+    {"--container", true, kReading,
+     [](CommandLine& c, const std::string& v) { Selection(c).container = v; return Status::Ok(); }},
+    {"--verbose", false, kAll, [](CommandLine& c, const std::string&) { c.verbose = true; return Status::Ok(); }},
+};
+
+const struct {
+  const char* name;
+  Command command;
+  size_t operands;  // FILE and/or DIR
+} kCommands[] = {{"create", Command::kCreate, 1}, {"show", Command::kShow, 1}, {"compare", Command::kCompare, 2}};
+
+// The option arg names ("--name" or "--name=value"), or null.
+const Option* FindOption(const std::string& arg) {
+  for (const Option& option : kOptions) {
+    const size_t n = std::char_traits<char>::length(option.name);
+    if (arg.compare(0, n, option.name) == 0 && (arg.size() == n || (option.takesValue && arg[n] == '='))) {
+      return &option;
+    }
+  }
+  return nullptr;
+}
+
+Status SetOperands(CommandLine& c, const std::vector<std::string>& operands) {
+  switch (c.command) {
+    case Command::kCreate:
+      c.create.walk.tree = operands[0];
+      if (c.create.output.empty()) return Error::Invalid("create needs -o FILE");
+      break;
+    case Command::kShow: c.show.manifest.file = operands[0]; break;
+    case Command::kCompare:
+      c.compare.manifest.file = operands[0];
+      c.compare.walk.tree = operands[1];
+      break;
+    case Command::kHelp: break;
+  }
+  return Status::Ok();
+}
+
+}  // namespace
+
+Result<CommandLine> ParseCommandLine(const std::vector<std::string>& arguments) {
+  CommandLine c;
+  if (arguments.empty()) return Error::Invalid("no command given");
+  const std::string& word = arguments[0];
+  if (word == "--help" || word == "-h" || word == "help") return c;
+  size_t operandCount = 0;
+  bool known = false;
+  for (const auto& command : kCommands) {
+    if (word == command.name) {
+      c.command = command.command;
+      operandCount = command.operands;
+      known = true;
+    }
+  }
+  if (!known) return Error::Invalid("unknown command '" + word + "'");
+
+  std::vector<std::string> operands;
+  bool optionsEnded = false;
+  for (size_t i = 1; i < arguments.size(); ++i) {
+    const std::string& arg = arguments[i];
+    if (optionsEnded || arg.size() < 2 || arg[0] != '-') {
+      operands.push_back(arg);
+      continue;
+    }
+    if (arg == "--") {
+      optionsEnded = true;
+      continue;
+    }
+    if (arg == "--help" || arg == "-h") {
+      c.command = Command::kHelp;
+      return c;
+    }
+    const Option* option = FindOption(arg);
+    if (option == nullptr) return Error::Invalid("unknown option '" + arg + "'");
+    if ((option->commands & Bit(c.command)) == 0) {
+      return Error::Invalid(std::string(option->name) + " is not an option of " + word);
+    }
+    std::string value;
+    if (option->takesValue) {
+      const size_t n = std::char_traits<char>::length(option->name);
+      if (arg.size() > n) {
+        value = arg.substr(n + 1);
+      } else if (i + 1 < arguments.size()) {
+        value = arguments[++i];
+      } else {
+        return Error::Invalid(std::string(option->name) + " needs a value");
+      }
+    }
+    if (Status applied = option->apply(c, value); !applied.ok()) return applied.error();
+  }
+  if (operands.size() != operandCount) {
+    return Error::Invalid(word + (operandCount == 1 ? " takes one operand" : " takes two operands"));
+  }
+  if (Status set = SetOperands(c, operands); !set.ok()) return set.error();
+  return c;
+}
+
+void PrintUsage(FILE* out) {
+  std::fputs(
+      "Usage:\n"
+      "  vtr-manifest create DIR [--relative-to R] [--inclusive] [--skip PATH]... [--jobs N] -o FILE\n"
+      "  vtr-manifest show FILE [--format text|json|xml] [--path KEY] [--container ID]\n"
+      "  vtr-manifest compare FILE DIR [--relative-to R] [--inclusive] [--skip PATH]... [--jobs N]\n"
+      "                       [--container ID]\n"
+      "\n"
+      "create   writes the manifest of the tree DIR (each item's attributes, extended\n"
+      "         attributes, SHA-1 and link target, keyed by its path relative to R,\n"
+      "         default DIR) to FILE as a binary property list, as the helper writes\n"
+      "         the device manifest. --inclusive adds DIR itself as \"/\"; --skip leaves\n"
+      "         out a path and everything below it. On a terminal, progress is drawn.\n"
+      "show     prints a manifest, or the manifest in a signed manifest's payload\n"
+      "         (\"Backup\", or a container's with --container; the signature is not\n"
+      "         checked): one line per path (text), or JSON (data as hex), or XML.\n"
+      "compare  walks DIR as create does and prints every difference from the\n"
+      "         manifest FILE as \"CODE NAME PATH\": 1 type-differs, 2 content-differs,\n"
+      "         3 link-target-differs, 4 owner-or-mode-differs, 5 xattrs-differ,\n"
+      "         0 missing-on-disk, and \"- not-in-manifest\" for items FILE lacks.\n"
+      "\n"
+      "Options:\n"
+      "  --jobs N     threads reading files (0: one item at a time on the main thread)\n"
+      "  --verbose    show every message of the builder, progress messages included\n"
+      "  --help       show this text\n"
+      "\n"
+      "Exit status: 0 success (compare: the tree matches), 1 compare found differences\n"
+      "or show found no such entry, 2 the work could not be done, 64 usage error.\n",
+      out);
+}
+
+}  // namespace vtr::manifest_tool
