@@ -1,4 +1,5 @@
 #include "tests/model/manifest_test_support.h"
+#include "tests/support/test_support.h"
 
 #include <fcntl.h>
 #include <grp.h>
@@ -62,27 +63,7 @@ DirectoryChain::~DirectoryChain() {
 }
 
 std::string RunUnprivileged(const std::function<std::string()>& body) {
-  int fds[2];
-  if (::pipe(fds) != 0) return "<pipe failed>";
-  const pid_t pid = ::fork();
-  if (pid < 0) return "<fork failed>";
-  if (pid == 0) {
-    ::close(fds[0]);
-    if (::geteuid() == 0 && (::setgroups(0, nullptr) != 0 || ::setgid(kNobody) != 0 || ::setuid(kNobody) != 0)) {
-      ::_exit(3);
-    }
-    const std::string result = body();
-    ::_exit(::write(fds[1], result.data(), result.size()) == static_cast<ssize_t>(result.size()) ? 0 : 2);
-  }
-  ::close(fds[1]);
-  std::string result;
-  char buffer[512];
-  for (ssize_t n; (n = ::read(fds[0], buffer, sizeof buffer)) > 0;) result.append(buffer, static_cast<size_t>(n));
-  ::close(fds[0]);
-  int status = 0;
-  if (::waitpid(pid, &status, 0) != pid) return "<waitpid failed>";
-  if (!WIFEXITED(status) || WEXITSTATUS(status) != 0) return "<child failed, status " + std::to_string(status) + ">";
-  return result;
+  return RunInChild([&] { return ::geteuid() != 0 || (::setgroups(0, nullptr) == 0 && ::setgid(kNobody) == 0 && ::setuid(kNobody) == 0); }, body);
 }
 
 }  // namespace vtr::testing

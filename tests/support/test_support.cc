@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <ftw.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <cstdlib>
@@ -100,5 +101,27 @@ LogCapture::LogCapture() : log_(std::make_shared<MemorySystemLog>()) {
 LogCapture::~LogCapture() { VTRLogModel::sharedInstance().setSystemLog(previous_); }
 
 bool IsRoot() { return ::geteuid() == 0; }
+
+std::string RunInChild(const std::function<bool()>& setUp, const std::function<std::string()>& body) {
+  int fds[2];
+  if (::pipe(fds) != 0) return "<pipe failed>";
+  const pid_t pid = ::fork();
+  if (pid < 0) return "<fork failed>";
+  if (pid == 0) {
+    ::close(fds[0]);
+    if (!setUp()) ::_exit(3);
+    const std::string result = body();
+    ::_exit(::write(fds[1], result.data(), result.size()) == static_cast<ssize_t>(result.size()) ? 0 : 2);
+  }
+  ::close(fds[1]);
+  std::string result;
+  char buffer[512];
+  for (ssize_t n; (n = ::read(fds[0], buffer, sizeof buffer)) > 0;) result.append(buffer, static_cast<size_t>(n));
+  ::close(fds[0]);
+  int status = 0;
+  if (::waitpid(pid, &status, 0) != pid) return "<waitpid failed>";
+  if (!WIFEXITED(status) || WEXITSTATUS(status) != 0) return "<child failed, status " + std::to_string(status) + ">";
+  return result;
+}
 
 }  // namespace vtr::testing

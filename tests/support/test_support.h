@@ -3,6 +3,7 @@
 #ifndef VTR_TESTS_SUPPORT_TEST_SUPPORT_H_
 #define VTR_TESTS_SUPPORT_TEST_SUPPORT_H_
 
+#include <functional>
 #include <memory>
 #include <string>
 #include <vector>
@@ -65,6 +66,12 @@ class LogCapture {
 
 // True when the tests run as root (ownership and mount tests need it).
 bool IsRoot();
+
+// Runs body in a forked child after setUp (which answers false when the child
+// cannot be prepared) and returns what body returned, or a text in angle
+// brackets saying what went wrong ("<fork failed>", "<child failed, ...>").
+// For tests that change the process itself (credentials, seccomp filters).
+std::string RunInChild(const std::function<bool()>& setUp, const std::function<std::string()>& body);
 
 }  // namespace vtr::testing
 
