@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <openssl/evp.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <memory>
 
@@ -41,7 +42,7 @@ bool DigestFile(int fd, EVP_MD_CTX* context, uint8_t* chunk) {
   ::posix_fadvise(fd, 0, 0, POSIX_FADV_SEQUENTIAL);
   off_t offset = 0;
   for (;;) {
-    const ssize_t n = ::read(fd, chunk, kFileHashChunkBytes);
+    const ssize_t n = ::pread(fd, chunk, kFileHashChunkBytes, offset);
     if (n < 0 && errno == EINTR) continue;
     if (n < 0) return false;
     if (n == 0) return true;
@@ -54,21 +55,31 @@ bool DigestFile(int fd, EVP_MD_CTX* context, uint8_t* chunk) {
 
 }  // namespace
 
-std::optional<Bytes> fileHash(const std::string& path) {
+std::optional<Bytes> fileHash(const std::string& path) { return fileHashAt(AT_FDCWD, path, path); }
+
+std::optional<Bytes> fileHashAt(int dirFd, const std::string& name, const std::string& path) {
+  return fileHashOfDescriptor(OpenFileForHashAt(dirFd, name).get(), path);
+}
+
+UniqueFd OpenFileForHashAt(int dirFd, const std::string& name) {
   // O_NOATIME: taking a manifest of a device should not rewrite the access
   // time of every file in it. Only the owner (or root) may ask for it.
   constexpr int kFlags = O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC;
-  UniqueFd fd(::open(path.c_str(), kFlags | O_NOATIME));
-  if (!fd && errno == EPERM) fd.reset(::open(path.c_str(), kFlags));
+  UniqueFd fd(::openat(dirFd, name.c_str(), kFlags | O_NOATIME));
+  if (!fd && errno == EPERM) fd.reset(::openat(dirFd, name.c_str(), kFlags));
+  return fd;
+}
+
+std::optional<Bytes> fileHashOfDescriptor(int fd, const std::string& path) {
   struct stat st;
-  if (!fd || ::fstat(fd.get(), &st) != 0 || !S_ISREG(st.st_mode)) {
+  if (fd < 0 || ::fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) {
     VTRLog("Cannot read file %@", path);
     return std::nullopt;
   }
   HashScratch& scratch = Scratch();
   Bytes digest(kFileHashDigestBytes);
   unsigned int length = 0;
-  if (!DigestFile(fd.get(), scratch.context.get(), scratch.chunk.get()) ||
+  if (!DigestFile(fd, scratch.context.get(), scratch.chunk.get()) ||
       EVP_DigestFinal_ex(scratch.context.get(), digest.data(), &length) != 1 || length != digest.size()) {
     VTRLog("Cannot read data from %@.", path);
     return std::nullopt;

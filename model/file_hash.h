@@ -14,6 +14,7 @@
 #include <optional>
 #include <string>
 
+#include "platform/unique_fd.h"
 #include "platform/value.h"
 
 namespace vtr {
@@ -28,9 +29,26 @@ inline constexpr size_t kFileHashDigestBytes = 20;
 // a non-blocking open (it could hang the helper or have effects on open).
 // The file's access time is left as it was wherever the caller may ask for
 // that (its owner, or root). A file that cannot be opened, or is not a
-// regular file, logs "Cannot read
-// file %@"; a read error logs "Cannot read data from %@.".
+// regular file, logs "Cannot read file %@"; a read error logs "Cannot read
+// data from %@.".
 std::optional<Bytes> fileHash(const std::string& path);
+
+// fileHash of the entry name of the open directory dirFd, looked up in that
+// directory alone; path names the file in the messages. dirFd stays the
+// caller's.
+std::optional<Bytes> fileHashAt(int dirFd, const std::string& name, const std::string& path);
+
+// Opens the entry name of dirFd for hashing as fileHash does (read-only,
+// never through a symbolic link, non-blocking, access time kept where
+// allowed); invalid with errno set when it cannot be opened. The descriptor
+// may serve other reads of the same item (extended attributes) first.
+UniqueFd OpenFileForHashAt(int dirFd, const std::string& name);
+
+// The digest of the file open as fd, read from its start whatever its
+// offset; fd stays the caller's. An invalid fd (the file could not be opened)
+// or one that is not a regular file logs "Cannot read file %@" (path), a
+// read error "Cannot read data from %@.".
+std::optional<Bytes> fileHashOfDescriptor(int fd, const std::string& path);
 
 // Directories carry no hash: always nullopt, without touching the disk.
 std::optional<Bytes> directoryHash(const std::string& path);

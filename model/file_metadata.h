@@ -23,6 +23,16 @@
 // Failures are logged (one line each, texts as below) and answered with an
 // absent result. A record is immutable; records may be used from several
 // threads at once. Functions returning a Value answer nil for "absent".
+//
+// The helper reads items as root inside trees that clients may own, so an
+// item is read as an entry of its open directory (initWithItemAt), never by
+// resolving its full path again: whatever a client renames or swaps for a
+// symbolic link above the item meanwhile, no link leads a read elsewhere.
+// The path-based operations open the item's directory once (following links
+// above the item, as any path does) and read the item from there; none
+// follows a symbolic link at the last component. Only on kernels older than
+// 6.13, which lack listxattrat and getxattrat, are a link's own extended
+// attributes read by path.
 #ifndef VTR_MODEL_FILE_METADATA_H_
 #define VTR_MODEL_FILE_METADATA_H_
 
@@ -60,9 +70,9 @@ class VTRFileMetadata {
   // ---- Reading an item (class operations) ----
 
   // The content hash of path for a record: nil with "File does not exist at
-  // %@" when nothing is there (links followed); empty data for a directory;
-  // otherwise the file's SHA-1, or empty data after "Maybe it's an Nimbrel
-  // file (%@)?" when it cannot be read.
+  // %@" when nothing is there; empty data for a directory; otherwise the
+  // file's SHA-1, or empty data after "Maybe it's an Nimbrel file (%@)?" when
+  // it cannot be read (a symbolic link is not followed and counts as such).
   static Value fileHashWithPath(const std::string& path);
 
   // The item's attribute dictionary (a symbolic link is described itself),
@@ -100,6 +110,16 @@ class VTRFileMetadata {
   // before it is hashed. An unreadable regular file still gives a record,
   // with an empty hash.
   static std::optional<VTRFileMetadata> initWithPath(const std::string& path);
+
+  // The record of the entry name of the open directory dirFd, as initWithPath
+  // makes it (same content, same messages) for an item that stays put.
+  // Attributes, link target and extended attributes are read relative to
+  // dirFd; a regular file or directory is opened there without following a
+  // link and its extended attributes and content read through that
+  // descriptor. path is the item's full path, for messages only. dirFd stays
+  // the caller's and must stay open for the call.
+  static std::optional<VTRFileMetadata> initWithItemAt(int dirFd, const std::string& name,
+                                                       const std::string& path);
   static std::optional<VTRFileMetadata> fileMetadatatWithPath(const std::string& path) { return initWithPath(path); }
 
   // A record holding dictionary as it is (shared, neither copied nor checked).

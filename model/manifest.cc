@@ -141,7 +141,7 @@ VTRManifest::Fill::Outcome VTRManifest::Fill::walk(const std::string& treePath,
       } else if (walker.type() == TreeWalker::ItemType::kOther) {
         pipeline.submitMessage(Format("%@ is special file. Leave it along", walker.path()));
       } else {
-        pipeline.submitRecord(walker.path());
+        pipeline.submitRecord(walker.path(), walker.parentDirectory(), walker.name());
       }
     }
     if (pipeline.empty()) return Outcome::kGoOn;

@@ -36,8 +36,11 @@
 // Records are made on worker threads (model/record_pipeline.h) while the
 // handler, keys, progress and every log line stay on the calling thread in
 // walk order: the output is exactly that of a sequential fill, and so is the
-// log. Items whose path reaches PATH_MAX are reported as not walkable, as the
-// record functions name items by path.
+// log. Each record is made from the item's entry in the directory the walk
+// opened, never by resolving its path again, so a directory swapped for a
+// link during the fill cannot lead the helper elsewhere. Items whose path
+// reaches PATH_MAX are reported as not walkable: their keys and log lines
+// name them by path.
 //
 // Threads: a manifest is used by one thread at a time; the handler and the
 // progress updater are called on the thread that called the fill.

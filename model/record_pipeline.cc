@@ -14,6 +14,13 @@ constexpr size_t kPublishBatch = 64;
 // wakes once to a run of finished items instead of once per item.
 constexpr size_t kWakeBatch = 32;
 
+// Makes item's record, then lets its directory go (closing it, when it was
+// the last item there to be made).
+void MakeRecord(RecordPipeline::Item* item) {
+  item->record = VTRFileMetadata::initWithItemAt(item->directory->get(), item->name, item->path);
+  item->directory.reset();
+}
+
 }  // namespace
 
 RecordPipeline::RecordPipeline(unsigned threads, size_t window) : window_(window == 0 ? 1 : window) {
@@ -31,10 +38,15 @@ RecordPipeline::~RecordPipeline() {
   for (std::thread& worker : workers_) worker.join();
 }
 
-void RecordPipeline::submitRecord(std::string path) {
-  if (++recordsInFlight_ >= window_) refilling_ = false;
+void RecordPipeline::submitRecord(std::string path, std::shared_ptr<const UniqueFd> directory, std::string name) {
   Slot& slot = slots_.emplace_back();
+  slot.item.startsDirectory = directory != lastDirectory_;
+  lastDirectory_ = directory;
+  if (slot.item.startsDirectory) ++directoriesInFlight_;
+  if (++recordsInFlight_ >= window_ || directoriesInFlight_ >= kMaxDirectoriesInFlight) refilling_ = false;
   slot.item.path = std::move(path);
+  slot.item.directory = std::move(directory);
+  slot.item.name = std::move(name);
   slot.item.wantsRecord = true;
   if (workers_.empty()) return;  // take() makes it
   unpublished_.push_back(&slot);
@@ -62,7 +74,7 @@ void RecordPipeline::publish() {
 RecordPipeline::Item RecordPipeline::take() {
   Slot& head = slots_.front();
   if (workers_.empty()) {
-    if (head.item.wantsRecord) head.item.record = VTRFileMetadata::fileMetadatatWithPath(head.item.path);
+    if (head.item.wantsRecord) MakeRecord(&head.item);
   } else if (!head.done.load(std::memory_order_acquire)) {
     publish();
     Slot* target = &slots_[std::min(kWakeBatch, slots_.size()) - 1];
@@ -83,7 +95,11 @@ RecordPipeline::Item RecordPipeline::take() {
   }
   Item item = std::move(head.item);
   slots_.pop_front();
-  if (item.wantsRecord && --recordsInFlight_ <= window_ / 2) refilling_ = true;
+  if (item.wantsRecord) {
+    --recordsInFlight_;
+    if (item.startsDirectory) --directoriesInFlight_;
+    if (recordsInFlight_ <= window_ / 2 && directoriesInFlight_ <= kMaxDirectoriesInFlight / 2) refilling_ = true;
+  }
   return item;
 }
 
@@ -97,7 +113,7 @@ RecordPipeline::Slot* RecordPipeline::nextPending() {
 void RecordPipeline::makeRecord(Slot* slot) {
   {
     ScopedLogDiversion diversion(&slot->item.log);
-    slot->item.record = VTRFileMetadata::fileMetadatatWithPath(slot->item.path);
+    MakeRecord(&slot->item);
   }
   slot->done.store(true);
 }

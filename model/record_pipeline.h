@@ -11,6 +11,12 @@
 // point where a sequential fill would have: the log reads as if every record
 // had been made in turn.
 //
+// Each record is made from the item's entry in its open directory, whose
+// shared descriptor the item holds until its record is made, so that nothing
+// renamed above the item while it waits changes what is read. Since those
+// descriptors count against the limit of open files, the items in flight
+// span at most kMaxDirectoriesInFlight runs of items from one directory.
+//
 // At most `window` records are in flight; messages (items without a record,
 // see submitMessage) take no worker and are not counted. A caller waiting in
 // take() makes pending records itself rather than sleep, so that the caller's
@@ -26,6 +32,7 @@
 #include <condition_variable>
 #include <cstddef>
 #include <deque>
+#include <memory>
 #include <mutex>
 #include <optional>
 #include <string>
@@ -33,14 +40,24 @@
 #include <vector>
 
 #include "model/file_metadata.h"
+#include "platform/unique_fd.h"
 
 namespace vtr {
 
 class RecordPipeline {
  public:
+  // Directory descriptors that records in flight may hold open: well under
+  // the usual limit of 1024 open files, beside what the walk itself holds.
+  static constexpr size_t kMaxDirectoriesInFlight = 128;
+
   struct Item {
     std::string path;
+    // The directory holding the item, and its name there; the directory is
+    // let go once the record is made.
+    std::shared_ptr<const UniqueFd> directory;
+    std::string name;
     bool wantsRecord = false;
+    bool startsDirectory = false;  // the first of a run of items in one directory
     // Messages for the caller to log, in order, before it uses the item: what
     // making the record logged on a worker, or the text of submitMessage.
     std::vector<std::string> log;
@@ -56,14 +73,16 @@ class RecordPipeline {
   RecordPipeline(const RecordPipeline&) = delete;
   RecordPipeline& operator=(const RecordPipeline&) = delete;
 
-  // True once `window` records are in flight, and until take() has brought
-  // them down to half of that: take() before submitting more. Refilling in
-  // bursts lets the workers run through many items per wake-up.
+  // True once `window` records (or kMaxDirectoriesInFlight directories) are
+  // in flight, and until take() has brought both down to half of that:
+  // take() before submitting more. Refilling in bursts lets the workers run
+  // through many items per wake-up.
   bool full() const { return !refilling_; }
   bool empty() const { return slots_.empty(); }
 
-  // Queues the making of path's record.
-  void submitRecord(std::string path);
+  // Queues the making of the record of the entry name of directory, whose
+  // full path is path (for messages and for the caller).
+  void submitRecord(std::string path, std::shared_ptr<const UniqueFd> directory, std::string name);
   // Queues an item without a record whose only content is message.
   void submitMessage(std::string message);
 
@@ -92,6 +111,9 @@ class RecordPipeline {
   std::deque<Slot> slots_;        // in submission order
   std::vector<Slot*> unpublished_;
   size_t recordsInFlight_ = 0;
+  size_t directoriesInFlight_ = 0;  // runs of items from one directory
+  // Kept, so that its address cannot be taken by another directory's.
+  std::shared_ptr<const UniqueFd> lastDirectory_;
   bool refilling_ = true;
 
   // Shared with the workers, under mutex_.

@@ -41,7 +41,9 @@ const std::string& TreeWalker::name() const {
   return level.entries[level.next - 1].name;
 }
 
-int TreeWalker::parentFd() const { return levels_.back().fd.get(); }
+int TreeWalker::parentFd() const { return levels_.back().fd->get(); }
+
+std::shared_ptr<const UniqueFd> TreeWalker::parentDirectory() const { return levels_.back().fd; }
 
 void TreeWalker::openRoot() {
   // The root keeps its spelling apart from trailing slashes, so that item
@@ -66,7 +68,7 @@ void TreeWalker::enter(int parentFd, const std::string& name, const std::string&
     onError_(path, entries.error());
     return;
   }
-  levels_.push_back(Level{std::move(fd), path, std::move(*entries), 0});
+  levels_.push_back(Level{std::make_shared<const UniqueFd>(std::move(fd)), path, std::move(*entries), 0});
 }
 
 Result<std::vector<TreeWalker::Entry>> TreeWalker::ReadEntries(int fd, const std::string& path) {
@@ -107,7 +109,7 @@ bool TreeWalker::typeOf(const Level& level, const Entry& entry, ItemType* type) 
     default: *type = ItemType::kOther; return true;
   }
   struct stat st;
-  if (::fstatat(level.fd.get(), entry.name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) {
+  if (::fstatat(level.fd->get(), entry.name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) {
     onError_(path_, Error::FromErrno(path_));
     return false;
   }
@@ -121,7 +123,7 @@ bool TreeWalker::next() {
     openRoot();
   } else if (enterCurrent_) {
     enterCurrent_ = false;
-    enter(levels_.back().fd.get(), name(), path_);
+    enter(levels_.back().fd->get(), name(), path_);
   }
   while (!levels_.empty()) {
     Level& level = levels_.back();

@@ -30,6 +30,7 @@
 
 #include <cstdint>
 #include <functional>
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -73,6 +74,12 @@ class TreeWalker {
   // the walker.
   const std::string& name() const;
   int parentFd() const;
+  // The same directory descriptor, shared: it stays open for as long as the
+  // caller keeps it, after the walk has left the directory, so that the
+  // item can be read relative to it later (on another thread). Many items
+  // share one descriptor; each kept one counts against the process's limit
+  // of open files.
+  std::shared_ptr<const UniqueFd> parentDirectory() const;
 
  private:
   struct Entry {
@@ -80,7 +87,7 @@ class TreeWalker {
     uint8_t dtype;  // DT_* from the directory listing
   };
   struct Level {
-    UniqueFd fd;
+    std::shared_ptr<const UniqueFd> fd;
     std::string path;
     std::vector<Entry> entries;  // sorted by name
     size_t next = 0;

@@ -1,7 +1,10 @@
-// The attribute dictionary of one item, from a single statx.
+// The attribute dictionary of one item, from a single statx, and the target
+// of a symbolic link.
 #include <fcntl.h>
+#include <linux/limits.h>
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
+#include <unistd.h>
 
 #include "platform/accounts.h"
 #include "platform/file_dates.h"
@@ -29,10 +32,12 @@ bool HasAttribute(const struct statx& stx, uint64_t flag) {
 
 }  // namespace
 
-Result<Value> AttributesOfItem(const std::string& path) {
+Result<Value> AttributesOfItem(const std::string& path) { return AttributesOfItemAt(AT_FDCWD, path, path); }
+
+Result<Value> AttributesOfItemAt(int dirFd, const std::string& name, const std::string& pathForErrors) {
   struct statx stx;
-  if (::statx(AT_FDCWD, path.c_str(), AT_SYMLINK_NOFOLLOW, STATX_BASIC_STATS | STATX_BTIME, &stx) != 0) {
-    return Error::FromErrno(path);
+  if (::statx(dirFd, name.c_str(), AT_SYMLINK_NOFOLLOW, STATX_BASIC_STATS | STATX_BTIME, &stx) != 0) {
+    return Error::FromErrno(pathForErrors);
   }
   const bool isDevice = S_ISCHR(stx.stx_mode) || S_ISBLK(stx.stx_mode);
   const std::shared_ptr<const AccountDatabase> accounts = AccountDatabase::Shared();
@@ -62,6 +67,17 @@ Result<Value> AttributesOfItem(const std::string& path) {
                  Value::Integer(static_cast<int64_t>(::makedev(stx.stx_dev_major, stx.stx_dev_minor))));
   attributes.add(kNSFileType, Value::String(FileTypeName(stx.stx_mode)));
   return attributes.build();
+}
+
+Result<std::string> DestinationOfSymbolicLinkAt(int dirFd, const std::string& name,
+                                                const std::string& pathForErrors) {
+  // Linux keeps link targets below PATH_MAX bytes; a full buffer means the
+  // text may have been cut.
+  char buffer[PATH_MAX];
+  const ssize_t n = ::readlinkat(dirFd, name.c_str(), buffer, sizeof buffer);
+  if (n < 0) return Error::FromErrno(pathForErrors);
+  if (static_cast<size_t>(n) == sizeof buffer) return Error(ENAMETOOLONG, pathForErrors);
+  return std::string(buffer, static_cast<size_t>(n));
 }
 
 }  // namespace vtr

@@ -44,13 +44,7 @@ Result<std::vector<std::string>> ContentsOfDirectory(const std::string& path) {
 }
 
 Result<std::string> DestinationOfSymbolicLink(const std::string& path) {
-  // Linux keeps link targets below PATH_MAX bytes; a full buffer means the
-  // text may have been cut.
-  char buffer[PATH_MAX];
-  const ssize_t n = ::readlink(path.c_str(), buffer, sizeof buffer);
-  if (n < 0) return Error::FromErrno(path);
-  if (static_cast<size_t>(n) == sizeof buffer) return Error(ENAMETOOLONG, path);
-  return std::string(buffer, static_cast<size_t>(n));
+  return DestinationOfSymbolicLinkAt(AT_FDCWD, path, path);
 }
 
 namespace {

@@ -81,6 +81,13 @@ bool FileExists(const std::string& path, bool* isDirectory = nullptr);
 // character and block devices NSFileDeviceIdentifier (integer).
 Result<Value> AttributesOfItem(const std::string& path);
 
+// AttributesOfItem of the entry name of the open directory dirFd (AT_FDCWD
+// for the working directory): the entry is looked up in that directory
+// alone, so nothing renamed or swapped above it changes which item is
+// described. A symbolic link there is described itself. pathForErrors names
+// the item in the error. dirFd stays the caller's.
+Result<Value> AttributesOfItemAt(int dirFd, const std::string& name, const std::string& pathForErrors);
+
 // What SetAttributes does when the last component of its path is a symbolic
 // link (it never follows it).
 enum class LinkAtPath {
@@ -149,6 +156,11 @@ Result<std::vector<std::string>> ContentsOfDirectory(const std::string& path);
 // The target text of the symbolic link at path, as stored (not resolved).
 // Fails with EINVAL when path is not a symbolic link.
 Result<std::string> DestinationOfSymbolicLink(const std::string& path);
+
+// DestinationOfSymbolicLink of the entry name of the open directory dirFd
+// (readlinkat); pathForErrors names the link in the error.
+Result<std::string> DestinationOfSymbolicLinkAt(int dirFd, const std::string& name,
+                                                const std::string& pathForErrors);
 
 }  // namespace vtr
 

@@ -9,6 +9,9 @@
 #include <sys/xattr.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <atomic>
+#include <cstdint>
 #include <cstring>
 #include <memory>
 
@@ -19,6 +22,13 @@
 // library's headers may predate it.
 #ifndef SYS_fchmodat2
 #define SYS_fchmodat2 452
+#endif
+// So have the extended-attribute calls relative to a directory (Linux 6.13).
+#ifndef SYS_getxattrat
+#define SYS_getxattrat 464
+#endif
+#ifndef SYS_listxattrat
+#define SYS_listxattrat 465
 #endif
 
 namespace vtr {
@@ -41,6 +51,19 @@ Result<struct statx> StatNode(int dir, const char* name, int flags, const std::s
   if (::statx(dir, name, flags | AT_SYMLINK_NOFOLLOW, STATX_BASIC_STATS, &stx) != 0) return Error::FromErrno(path);
   return stx;
 }
+
+// The argument block of getxattrat, as the kernel defines it (the C
+// library's headers may predate it).
+struct XattrArgs {
+  uint64_t value;  // user address of the buffer
+  uint32_t size;
+  uint32_t flags;
+};
+static_assert(sizeof(XattrArgs) == 16, "getxattrat takes the first version of its arguments");
+
+// Set once a kernel without the *xattrat calls has answered ENOSYS, so that
+// it is not asked again for every item.
+std::atomic<bool> xattrAtMissing{false};
 
 bool IsPermissionDenied(int error) { return error == EPERM || error == EACCES; }
 
@@ -248,6 +271,37 @@ Status ChangeModeAt(int dirFd, const std::string& name, mode_t mode, const std::
   if (errno != ENOSYS) return Error::FromErrno(pathForErrors);
   if (::fchmodat(dirFd, name.c_str(), mode, AT_SYMLINK_NOFOLLOW) == 0) return Status::Ok();
   return Error::FromErrno(pathForErrors);
+}
+
+ssize_t ListExtendedAttributesAt(int dirFd, const std::string& name, char* list, size_t size,
+                                 const std::string* fallbackPath) {
+  if (!xattrAtMissing.load(std::memory_order_relaxed)) {
+    const long n = ::syscall(SYS_listxattrat, dirFd, name.c_str(), AT_SYMLINK_NOFOLLOW, list, size);
+    if (n >= 0 || errno != ENOSYS) return n;
+    xattrAtMissing.store(true, std::memory_order_relaxed);
+  }
+  if (fallbackPath == nullptr) {
+    errno = ENOSYS;
+    return -1;
+  }
+  return ::llistxattr(fallbackPath->c_str(), list, size);
+}
+
+ssize_t GetExtendedAttributeAt(int dirFd, const std::string& name, const std::string& key, void* value,
+                               size_t size, const std::string* fallbackPath) {
+  if (!xattrAtMissing.load(std::memory_order_relaxed)) {
+    // The kernel takes the size as 32 bits; values are bounded far below.
+    XattrArgs args{reinterpret_cast<uintptr_t>(value), static_cast<uint32_t>(std::min<size_t>(size, UINT32_MAX)), 0};
+    const long n = ::syscall(SYS_getxattrat, dirFd, name.c_str(), AT_SYMLINK_NOFOLLOW, key.c_str(), &args,
+                             sizeof args);
+    if (n >= 0 || errno != ENOSYS) return n;
+    xattrAtMissing.store(true, std::memory_order_relaxed);
+  }
+  if (fallbackPath == nullptr) {
+    errno = ENOSYS;
+    return -1;
+  }
+  return ::lgetxattr(fallbackPath->c_str(), key.c_str(), value, size);
 }
 
 Status ReplicateItem(int srcDir, const std::string& srcName, int dstDir, const std::string& dstName,

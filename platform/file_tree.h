@@ -33,6 +33,19 @@ Result<std::vector<std::string>> DirectoryEntryNames(int dirFd, const std::strin
 // C library's fchmodat, which needs /proc for this).
 Status ChangeModeAt(int dirFd, const std::string& name, mode_t mode, const std::string& pathForErrors);
 
+// The extended attributes of the entry name of dirFd itself, a symbolic
+// link there not followed, for items that cannot be opened (links): the
+// listxattrat and getxattrat system calls (Linux 6.13), which look the entry
+// up in dirFd alone. They answer as llistxattr and lgetxattr do: the length
+// of the name list or value (the size needed when size is 0), or -1 with
+// errno. On older kernels the item is reached by fallbackPath with
+// llistxattr / lgetxattr when one is given, which resolves that whole path
+// again; without one they fail with ENOSYS.
+ssize_t ListExtendedAttributesAt(int dirFd, const std::string& name, char* list, size_t size,
+                                 const std::string* fallbackPath);
+ssize_t GetExtendedAttributeAt(int dirFd, const std::string& name, const std::string& key, void* value,
+                               size_t size, const std::string* fallbackPath);
+
 // How ReplicateItem makes the files of the copy.
 enum class Replication {
   kCopy,      // new files with the source's data, mode, owner, times and extended attributes

@@ -2,6 +2,7 @@
 // read), and the typed getters over malformed dictionaries.
 #include "model/file_metadata.h"
 
+#include <fcntl.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/xattr.h>
@@ -11,6 +12,7 @@
 
 #include "platform/accounts.h"
 #include "platform/file_manager.h"
+#include "platform/unique_fd.h"
 #include "tests/model/failing_syscall.h"
 #include "tests/support/test_support.h"
 
@@ -24,10 +26,13 @@ using testing::WriteFile;
 Value DataOf(const std::string& text) { return Value::Data(text.data(), text.size()); }
 const Value kEmpty = Value::DictionaryOf(Dictionary());
 
-// "keys of the record; hash bytes" and the log lines, one per line.
-std::string DescribeRecordOf(const std::string& path) {
+// "keys of the record; hash bytes" and the log lines, one per line. With a
+// directory descriptor, the record is made of the entry relative to it.
+std::string DescribeRecordOf(const std::string& path, int dirFd = -1) {
   LogCapture log;
-  std::optional<VTRFileMetadata> record = VTRFileMetadata::initWithPath(path);
+  std::optional<VTRFileMetadata> record =
+      dirFd < 0 ? VTRFileMetadata::initWithPath(path)
+                : VTRFileMetadata::initWithItemAt(dirFd, path.substr(path.rfind('/') + 1), path);
   std::string text = record ? "" : "no record";
   if (record) {
     for (const auto& entry : *record->dict().dictionary()) text += entry.first + " ";
@@ -103,27 +108,33 @@ TEST(FileMetadataTest, UnreadablePartsCutTheRecordShortOrEmptyTheHash) {
   WriteFile(file, "content");
   ASSERT_EQ(::symlink("file", link.c_str()), 0);
   AccountDatabase::Shared();  // read now, before the filters could break its reading
-  std::vector<long> readlinkCalls = {SYS_readlinkat};
-#ifdef SYS_readlink
-  readlinkCalls.push_back(SYS_readlink);
-#endif
+  // Opened before the filters: with opens failing, only the item itself
+  // cannot be opened.
+  const UniqueFd dirFd(::open(dir.path().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  ASSERT_TRUE(dirFd.valid());
+  const long kListXattrAt = 465;  // listxattrat, which a link's own list comes from
   const struct {
     std::vector<long> calls;
     int error;
     std::string path;
     std::string expected;
   } cases[] = {
-      {{SYS_llistxattr}, EIO, file,
+      {{SYS_flistxattr}, EIO, file,
        "VTRManifestFileAttributes no hash\nCould not extract extended attributes from " + file +
            ".\nCould not get attribute keys from file " + file},
-      {{SYS_openat, SYS_open}, EACCES, file,
+      {{kListXattrAt}, EIO, link,
+       "VTRManifestFileAttributes no hash\nCould not extract extended attributes from " + link +
+           ".\nCould not get attribute keys from file " + link},
+      // The list then comes relative to the directory instead.
+      {{SYS_openat}, EACCES, file,
        kAllKeys + "hash 0\nCannot read file " + file + "\nMaybe it's an Nimbrel file (" + file + ")?"},
-      {readlinkCalls, EIO, link,
+      {{SYS_readlinkat}, EIO, link,
        "VTRManifestFileAttributes VTRManifestFileExtendedAttributes VTRManifestFileHash hash 0\n"
        "Could not get destination of symbolic link " + link + " with error - " + link + ": Input/output error"},
   };
   for (const auto& c : cases) {
-    EXPECT_EQ(testing::RunWithFailingSyscalls(c.calls, c.error, [&] { return DescribeRecordOf(c.path); }),
+    EXPECT_EQ(testing::RunWithFailingSyscalls(c.calls, c.error,
+                                              [&] { return DescribeRecordOf(c.path, dirFd.get()); }),
               c.expected);
   }
 }
