@@ -17,6 +17,7 @@
 #include <string_view>
 #include <vector>
 
+#include "platform/base64.h"
 #include "platform/format.h"
 #include "platform/plist.h"
 
@@ -91,20 +92,6 @@ Status AppendEscaped(std::string_view text, std::string* out) {
     i += length;
   }
   return Status::Ok();
-}
-
-void AppendBase64(const Bytes& bytes, std::string* out) {
-  static constexpr char kDigits[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
-  for (size_t i = 0; i < bytes.size(); i += 3) {
-    const size_t n = std::min<size_t>(3, bytes.size() - i);
-    uint32_t group = uint32_t{bytes[i]} << 16;
-    if (n > 1) group |= uint32_t{bytes[i + 1]} << 8;
-    if (n > 2) group |= bytes[i + 2];
-    out->push_back(kDigits[group >> 18 & 0x3f]);
-    out->push_back(kDigits[group >> 12 & 0x3f]);
-    out->push_back(n > 1 ? kDigits[group >> 6 & 0x3f] : '=');
-    out->push_back(n > 2 ? kDigits[group & 0x3f] : '=');
-  }
 }
 
 std::string RealText(double d) {

@@ -19,6 +19,18 @@ inline struct stat Lstat(const std::string& path) {
   return st;
 }
 
+// Whether something (a dangling link included) stands at path.
+inline bool Exists(const std::string& path) {
+  struct stat st;
+  return ::lstat(path.c_str(), &st) == 0;
+}
+
+// Whether a directory (not a link to one) stands at path.
+inline bool IsDirectory(const std::string& path) {
+  struct stat st;
+  return ::lstat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
+}
+
 // The value of the extended attribute name of path itself, or "<none>".
 inline std::string Xattr(const std::string& path, const char* name) {
   char value[256];

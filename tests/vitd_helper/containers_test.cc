@@ -4,24 +4,13 @@
 
 #include <gtest/gtest.h>
 
+#include "tests/support/file_inspection.h"
 #include "tests/support/test_support.h"
 #include "tests/vitd_helper/helper_sandbox.h"
 #include "vitd_helper/operations.h"
 
 namespace vtr::testing {
 namespace {
-
-struct stat Lstat(const std::string& path) {
-  struct stat st = {};
-  st.st_mode = 0;
-  ::lstat(path.c_str(), &st);
-  return st;
-}
-
-bool Exists(const std::string& path) {
-  struct stat st;
-  return ::lstat(path.c_str(), &st) == 0;
-}
 
 class ContainersTest : public ::testing::Test {
  protected:

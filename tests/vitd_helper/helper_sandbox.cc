@@ -12,22 +12,12 @@
 
 #include <gtest/gtest.h>
 
+#include "platform/make_directories.h"
 #include "tests/support/test_support.h"
 #include "xpc/client.h"
 
 namespace vtr::testing {
 namespace {
-
-void MakeDirs(const std::string& path) {
-  std::string prefix;
-  std::stringstream parts(path);
-  std::string part;
-  while (std::getline(parts, part, '/')) {
-    if (part.empty()) continue;
-    prefix += "/" + part;
-    ::mkdir(prefix.c_str(), 0755);
-  }
-}
 
 int StatusOf(int raw) { return WIFEXITED(raw) ? WEXITSTATUS(raw) : -1; }
 
@@ -46,7 +36,7 @@ HelperSandbox::HelperSandbox() {
   ::chmod(root_.c_str(), 0755);
   for (const char* dir : {"/etc", "/run", "/private/var/root/Library/Preferences",
                           "/private/var/mobile/Library/Preferences", "/private/var/logs"}) {
-    MakeDirs(root_ + dir);
+    EXPECT_TRUE(MakeDirectories(root_ + dir).ok()) << dir;
   }
   ::symlink("private/var", (root_ + "/var").c_str());
   WriteFile(root_ + "/etc/passwd",

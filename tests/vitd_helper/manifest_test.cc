@@ -6,6 +6,7 @@
 #include <gtest/gtest.h>
 
 #include "platform/plist.h"
+#include "tests/support/file_inspection.h"
 #include "tests/support/test_support.h"
 #include "tests/vitd_helper/helper_sandbox.h"
 
@@ -15,14 +16,6 @@ namespace {
 using namespace std::chrono_literals;
 
 constexpr char kManifest[] = "/private/var/VTRWorkContainer/DeviceManifest.plist";
-
-struct stat Lstat(const std::string& path) {
-  struct stat st = {};
-  ::lstat(path.c_str(), &st);
-  return st;
-}
-
-bool Exists(const std::string& path) { return ::access(path.c_str(), F_OK) == 0 || Lstat(path).st_mode != 0; }
 
 void MakeDir(const std::string& path, mode_t mode = 0755) { ASSERT_EQ(::mkdir(path.c_str(), mode), 0) << path; }
 

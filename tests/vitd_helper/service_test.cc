@@ -12,6 +12,7 @@
 
 #include <gtest/gtest.h>
 
+#include "tests/support/file_inspection.h"
 #include "tests/support/test_support.h"
 #include "tests/vitd_helper/helper_sandbox.h"
 #include "xpc/client.h"
@@ -27,11 +28,6 @@ XpcObject Request(std::initializer_list<std::pair<std::string, XpcObject>> entri
 }
 
 XpcObject Response(bool value) { return XpcObject::Dictionary({{"Response", XpcObject::Bool(value)}}); }
-
-bool IsDirectory(const std::string& path) {
-  struct stat st;
-  return ::lstat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
-}
 
 class ServiceTest : public ::testing::Test {
  protected:

@@ -4,6 +4,7 @@
 
 #include <cerrno>
 
+#include "platform/base64.h"
 #include "xpc/client.h"
 
 namespace vtr::vitdctl {
@@ -12,20 +13,8 @@ namespace {
 using Json = nlohmann::json;
 
 std::string Base64(const XpcBytes& bytes) {
-  static constexpr char kAlphabet[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
   std::string out;
-  size_t i = 0;
-  for (; i + 2 < bytes.size(); i += 3) {
-    const uint32_t n = (bytes[i] << 16) | (bytes[i + 1] << 8) | bytes[i + 2];
-    out += {kAlphabet[n >> 18], kAlphabet[(n >> 12) & 63], kAlphabet[(n >> 6) & 63], kAlphabet[n & 63]};
-  }
-  if (i + 1 == bytes.size()) {
-    const uint32_t n = bytes[i] << 16;
-    out += {kAlphabet[n >> 18], kAlphabet[(n >> 12) & 63], '=', '='};
-  } else if (i + 2 == bytes.size()) {
-    const uint32_t n = (bytes[i] << 16) | (bytes[i + 1] << 8);
-    out += {kAlphabet[n >> 18], kAlphabet[(n >> 12) & 63], kAlphabet[(n >> 6) & 63], '='};
-  }
+  AppendBase64(bytes, &out);
   return out;
 }
 
