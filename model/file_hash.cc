@@ -5,9 +5,11 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <memory>
 
 #include "model/log.h"
+#include "platform/termination.h"
 #include "platform/unique_fd.h"
 
 namespace vtr {
@@ -36,13 +38,17 @@ HashScratch& Scratch() {
   return scratch;
 }
 
-// Feeds the whole file to the digest; false on a read error.
-bool DigestFile(int fd, EVP_MD_CTX* context, uint8_t* chunk) {
+// Feeds the first size bytes of the file (its size when it was opened: a
+// file that grows while it is read is never read past that) to the digest;
+// false on a read error, and when the helper is asked to terminate.
+bool DigestFile(int fd, off_t size, EVP_MD_CTX* context, uint8_t* chunk) {
   if (context == nullptr || EVP_DigestInit_ex(context, Sha1(), nullptr) != 1) return false;
   ::posix_fadvise(fd, 0, 0, POSIX_FADV_SEQUENTIAL);
   off_t offset = 0;
-  for (;;) {
-    const ssize_t n = ::pread(fd, chunk, kFileHashChunkBytes, offset);
+  while (offset < size) {
+    if (TerminationRequested()) return false;
+    const size_t want = static_cast<size_t>(std::min<off_t>(size - offset, kFileHashChunkBytes));
+    const ssize_t n = ::pread(fd, chunk, want, offset);
     if (n < 0 && errno == EINTR) continue;
     if (n < 0) return false;
     if (n == 0) return true;
@@ -51,6 +57,7 @@ bool DigestFile(int fd, EVP_MD_CTX* context, uint8_t* chunk) {
     ::posix_fadvise(fd, offset, n, POSIX_FADV_DONTNEED);
     offset += n;
   }
+  return true;
 }
 
 }  // namespace
@@ -79,7 +86,7 @@ std::optional<Bytes> fileHashOfDescriptor(int fd, const std::string& path) {
   HashScratch& scratch = Scratch();
   Bytes digest(kFileHashDigestBytes);
   unsigned int length = 0;
-  if (!DigestFile(fd, scratch.context.get(), scratch.chunk.get()) ||
+  if (!DigestFile(fd, st.st_size, scratch.context.get(), scratch.chunk.get()) ||
       EVP_DigestFinal_ex(scratch.context.get(), digest.data(), &length) != 1 || length != digest.size()) {
     VTRLog("Cannot read data from %@.", path);
     return std::nullopt;

@@ -4,14 +4,15 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstring>
 #include <optional>
 #include <utility>
 #include <vector>
 
 #include "platform/file_dates.h"
-#include "platform/file_manager.h"
-#include "platform/make_directories.h"
+#include "platform/file_tree.h"
+#include "platform/open_beneath.h"
 #include "platform/remove_item.h"
 
 namespace vtr {
@@ -21,6 +22,12 @@ constexpr char kProbeName[] = "testWritability.log";
 
 // Where this thread's messages go instead of being written (ScopedLogDiversion).
 thread_local std::vector<std::string>* t_divertedMessages = nullptr;
+// The peer whose lines this thread logs (ScopedLogPeer).
+thread_local std::optional<uint32_t> t_logPeer;
+
+// Budgets of peers not heard from for this long are forgotten.
+constexpr auto kPeerBudgetIdle = std::chrono::minutes(5);
+constexpr size_t kMaxPeerBudgets = 4096;
 
 // "~/x" becomes "$HOME/x"; other paths stay as they are.
 std::string ExpandTilde(const std::string& path) {
@@ -29,25 +36,21 @@ std::string ExpandTilde(const std::string& path) {
   return std::string(home ? home : "") + path.substr(1);
 }
 
-std::string ParentOf(const std::string& path) {
-  const size_t slash = path.rfind('/');
-  if (slash == std::string::npos) return ".";
-  return slash == 0 ? "/" : path.substr(0, slash);
+// message cut to the longest line, the rest counted.
+std::string_view CapLine(std::string_view message, std::string* holder) {
+  if (message.size() <= VTRLogModel::kMaxLogLineBytes) return message;
+  const size_t kept = VTRLogModel::kMaxLogLineBytes - 64;
+  *holder = std::string(message.substr(0, kept)) + Format(" ... (%zu more bytes)", message.size() - kept);
+  return *holder;
 }
 
-bool IsDirectory(const std::string& path) {
-  struct stat st;
-  return ::stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
-}
-
-// Creates dir/testWritability.log holding "a" and removes it again.
-bool ProbeWritable(const std::string& directory) {
-  const std::string probe = directory + "/" + kProbeName;
-  const int fd = ::open(probe.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0644);
+// Creates folder/testWritability.log holding "a" and removes it again.
+bool ProbeWritable(int folder) {
+  const int fd = ::openat(folder, kProbeName, O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC, 0644);
   if (fd < 0) return false;
   const bool written = ::write(fd, "a", 1) == 1;
   ::close(fd);
-  ::unlink(probe.c_str());
+  ::unlinkat(folder, kProbeName, 0);
   return written;
 }
 
@@ -66,6 +69,20 @@ void VTRLogModel::logMessage(std::string_view message) {
     t_divertedMessages->emplace_back(message);
     return;
   }
+  std::string holder;
+  message = CapLine(message, &holder);
+  if (t_logPeer) {
+    uint64_t suppressed = 0;
+    if (!admitPeerLine(*t_logPeer, &suppressed)) return;
+    if (suppressed > 0) {
+      writeLine(Format("%llu lines caused by uid %u were suppressed", static_cast<unsigned long long>(suppressed),
+                       *t_logPeer));
+    }
+  }
+  writeLine(message);
+}
+
+void VTRLogModel::writeLine(std::string_view message) {
   std::shared_ptr<SystemLog> systemLog;
   {
     std::lock_guard<std::mutex> lock(mutex_);
@@ -79,16 +96,70 @@ void VTRLogModel::logMessage(std::string_view message) {
   systemLog->write(message);
 }
 
+bool VTRLogModel::admitPeerLine(uint32_t peer, uint64_t* suppressed) {
+  const auto now = std::chrono::steady_clock::now();
+  std::lock_guard<std::mutex> lock(mutex_);
+  if (peerBudgets_.size() >= kMaxPeerBudgets) {
+    std::erase_if(peerBudgets_, [now](const auto& entry) { return now - entry.second.refilled > kPeerBudgetIdle; });
+  }
+  PeerBudget& budget = peerBudgets_[peer];
+  const double elapsed = std::chrono::duration<double>(now - budget.refilled).count();
+  budget.lines = std::min(kPeerBurstLines, budget.lines + elapsed * kPeerLinesPerSecond);
+  budget.refilled = now;
+  if (budget.lines < 1) {
+    ++budget.suppressed;
+    return false;
+  }
+  budget.lines -= 1;
+  *suppressed = std::exchange(budget.suppressed, 0);
+  return true;
+}
+
 void VTRLogModel::systemLogOnly(std::string_view message) { systemLog()->write(message); }
 
-bool VTRLogModel::enableLogToFile(const std::string& path) {
-  const std::string expanded = ExpandTilde(path);
-  const std::string parent = ParentOf(expanded);
-  if (!IsDirectory(parent) && !MakeDirectories(parent).ok()) return false;
-  FILE* fp = std::fopen(expanded.c_str(), "ae");
+UniqueFd VTRLogModel::openLogFolder(const std::string& directory) {
+  Result<std::vector<std::string>> components = SplitPathComponents(directory);
+  if (!components.ok()) return UniqueFd();
+  UniqueFd root(::open("/", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  Result<UniqueFd> folder = OpenDirectoryBeneath(root.get(), *components, components->size(), true, 0755);
+  if (!folder.ok()) return UniqueFd();
+  struct stat st;
+  if (::fstat(folder->get(), &st) != 0) return UniqueFd();
+  if (st.st_uid != ::geteuid() || (st.st_mode & 022) != 0) {
+    systemLogOnly(Format("The log folder %s is owned by uid %u with mode %04o, not by this user and closed to others; "
+                         "logging to the system log only",
+                         directory, st.st_uid, st.st_mode & 07777));
+    return UniqueFd();
+  }
+  return std::move(*folder);
+}
+
+bool VTRLogModel::openDayFile(int folder, const std::string& name, const std::string& path) {
+  UniqueFd fd(::openat(folder, name.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC, 0644));
+  struct stat st;
+  FILE* fp = nullptr;
+  if (fd && ::fstat(fd.get(), &st) == 0) {
+    if (S_ISREG(st.st_mode) && st.st_uid == ::geteuid() && st.st_nlink == 1) {
+      fp = ::fdopen(fd.get(), "a");
+      if (fp != nullptr) fd.release();
+    } else {
+      systemLogOnly(Format("The log file %s is not a regular file of this user with one link; "
+                           "logging to the system log only",
+                           path));
+    }
+  }
   std::lock_guard<std::mutex> lock(mutex_);
   logFP_ = fp;
   return fp != nullptr;
+}
+
+bool VTRLogModel::enableLogToFile(const std::string& path) {
+  const std::string expanded = ExpandTilde(path);
+  const size_t slash = expanded.rfind('/');
+  if (slash == std::string::npos) return false;
+  UniqueFd folder = openLogFolder(slash == 0 ? "/" : expanded.substr(0, slash));
+  if (!folder) return false;
+  return openDayFile(folder.get(), expanded.substr(slash + 1), expanded);
 }
 
 bool VTRLogModel::logToFileEnabled() const {
@@ -97,8 +168,8 @@ bool VTRLogModel::logToFileEnabled() const {
 }
 
 bool VTRLogModel::enableLogToFilesUnder(const std::string& directory, const std::string& prefix, long expireDays) {
-  if (!IsDirectory(directory) && !MakeDirectories(directory).ok()) return false;
-  if (!ProbeWritable(directory)) return false;
+  UniqueFd folder = openLogFolder(directory);
+  if (!folder || !ProbeWritable(folder.get())) return false;
 
   std::shared_ptr<Clock> clock;
   {
@@ -106,19 +177,22 @@ bool VTRLogModel::enableLogToFilesUnder(const std::string& directory, const std:
     clock = clock_;
   }
   const Date cutoff{clock->now().secondsSince2001 - static_cast<double>(expireDays) * 86400.0};
-  // A directory that cannot be listed is not swept.
-  if (Result<std::vector<std::string>> names = ContentsOfDirectory(directory); names.ok()) {
+  // A directory that cannot be listed is not swept. Entries are looked at and
+  // removed relative to the folder, never followed.
+  if (Result<std::vector<std::string>> names = DirectoryEntryNames(folder.get(), directory); names.ok()) {
+    std::sort(names->begin(), names->end());
     for (const std::string& name : *names) {
       const std::string fullPath = Format("%@/%@", directory, name);
-      systemLogOnly(Format("Checking existing log file (full path) %@ against %@", fullPath, cutoff));
-      const std::optional<Date> created = CreationDateOfItem(fullPath);
+      systemLogOnly(FormatEscaped("Checking existing log file (full path) %@ against %@", fullPath, cutoff));
+      const std::optional<Date> created = CreationDateOfItemAt(folder.get(), name);
       if (created && *created < cutoff) {
-        systemLogOnly(Format("Removing %@ whose creation date is %@.", fullPath, *created));
-        (void)RemoveItem(fullPath);
+        systemLogOnly(FormatEscaped("Removing %@ whose creation date is %@.", fullPath, *created));
+        (void)RemoveItemAt(folder.get(), name, fullPath);
       }
     }
   }
-  return enableLogToFile(fileNameForTodayUnder(directory, prefix));
+  const std::string path = fileNameForTodayUnder(directory, prefix);
+  return openDayFile(folder.get(), path.substr(path.rfind('/') + 1), path);
 }
 
 std::string VTRLogModel::fileNameForTodayUnder(const std::string& directory, const std::string& prefix) const {
@@ -161,5 +235,9 @@ ScopedLogDiversion::ScopedLogDiversion(std::vector<std::string>* messages)
     : previous_(std::exchange(t_divertedMessages, messages)) {}
 
 ScopedLogDiversion::~ScopedLogDiversion() { t_divertedMessages = previous_; }
+
+ScopedLogPeer::ScopedLogPeer(std::optional<uint32_t> peer) : previous_(std::exchange(t_logPeer, peer)) {}
+
+ScopedLogPeer::~ScopedLogPeer() { t_logPeer = previous_; }
 
 }  // namespace vtr

@@ -3,14 +3,31 @@
 // time stamp to one log file per start-up day. File logging is switched on
 // once, at start-up, after a sweep of old entries from the log directory.
 //
+// The helper writes its files as root in a folder it shares with nobody: the
+// folder must be a directory of the helper's own user that group and others
+// cannot write (created 0755 when missing), and the day's file is opened
+// relative to it without following a link, and used only when it is a
+// regular file of the helper's own user with one link. Otherwise file
+// logging stays off and the system log says why.
+//
+// Every line is one line: the formatted values have their control
+// characters escaped (FormatEscaped), and a message longer than
+// kMaxLogLineBytes is cut, the rest replaced by a count. Lines caused by one
+// peer (ScopedLogPeer) are rate-limited: a burst, then one line counting
+// what was suppressed once lines flow again.
+//
 // Thread safety: logMessage() may be called from any thread; writing and
 // flushing the file happen under the model's one lock, the system-log copy
 // outside it. The set-up calls (enable..., set...) are made before serving.
 #ifndef VTR_MODEL_LOG_MODEL_H_
 #define VTR_MODEL_LOG_MODEL_H_
 
+#include <chrono>
+#include <cstdint>
 #include <cstdio>
 #include <memory>
+#include <optional>
+#include <unordered_map>
 #include <mutex>
 #include <string>
 #include <string_view>
@@ -19,6 +36,7 @@
 #include "platform/clock.h"
 #include "platform/format.h"
 #include "platform/system_log.h"
+#include "platform/unique_fd.h"
 
 namespace vtr {
 
@@ -34,10 +52,16 @@ class VTRLogModel {
   // made for a test closes nothing either, the test owns the stream.
   ~VTRLogModel() = default;
 
-  // Formats the message and writes it (see logMessage).
+  // Longest line written; the rest of a longer message is replaced by a count.
+  static constexpr size_t kMaxLogLineBytes = 64 * 1024;
+  // Lines one peer may cause in a burst, and per second after it.
+  static constexpr double kPeerBurstLines = 200;
+  static constexpr double kPeerLinesPerSecond = 20;
+
+  // Formats the message, values escaped, and writes it (see logMessage).
   template <typename... Args>
   void logWithFormat(FormatString<std::type_identity_t<Args>...> format, const Args&... args) {
-    logMessage(Format(format, args...));
+    logMessage(FormatEscaped(format, args...));
   }
 
   // Appends "<date description> <message>\n" to the log file when file
@@ -47,8 +71,8 @@ class VTRLogModel {
 
   // Opens path for appending (created if missing, never truncated), creating
   // its parent directory if needed. Returns false when the parent cannot be
-  // created (the stream is left as it was) or the file cannot be opened (the
-  // stream becomes null).
+  // created or is not safe (the stream is left as it was) or the file cannot
+  // be opened or is not safe (the stream becomes null).
   bool enableLogToFile(const std::string& path);
   bool logToFileEnabled() const;
 
@@ -75,11 +99,28 @@ class VTRLogModel {
   void setClock(std::shared_ptr<Clock> clock);
 
  private:
+  struct PeerBudget {
+    double lines = kPeerBurstLines;
+    std::chrono::steady_clock::time_point refilled = std::chrono::steady_clock::now();
+    uint64_t suppressed = 0;
+  };
+
   // The system log alone, as the expiry sweep reports.
   void systemLogOnly(std::string_view message);
+  // Writes one line to the file and the system log.
+  void writeLine(std::string_view message);
+  // Whether a line caused by peer may be written now; *suppressed becomes
+  // the count of lines held back before it (to be reported first).
+  bool admitPeerLine(uint32_t peer, uint64_t* suppressed);
+  // The folder of the log files opened (created when missing) and checked,
+  // or an invalid fd after the system log said why.
+  UniqueFd openLogFolder(const std::string& directory);
+  // Opens name in folder for appending, checked (see above).
+  bool openDayFile(int folder, const std::string& name, const std::string& path);
 
-  mutable std::mutex mutex_;  // the one lock: file writes and flushes
+  mutable std::mutex mutex_;  // the one lock: file writes and flushes, peer budgets
   FILE* logFP_ = nullptr;
+  std::unordered_map<uint32_t, PeerBudget> peerBudgets_;
   std::shared_ptr<SystemLog> systemLog_;
   std::shared_ptr<Clock> clock_;
 };
@@ -98,6 +139,20 @@ class ScopedLogDiversion {
 
  private:
   std::vector<std::string>* previous_;
+};
+
+// While alive, lines logged on the thread that made it are caused by peer
+// (its uid) and rate-limited as such; nullopt marks work that is not any
+// peer's to limit (an entitled client's command). Scopes nest.
+class ScopedLogPeer {
+ public:
+  explicit ScopedLogPeer(std::optional<uint32_t> peer);
+  ~ScopedLogPeer();
+  ScopedLogPeer(const ScopedLogPeer&) = delete;
+  ScopedLogPeer& operator=(const ScopedLogPeer&) = delete;
+
+ private:
+  std::optional<uint32_t> previous_;
 };
 
 }  // namespace vtr

@@ -11,6 +11,7 @@
 #include "model/tree_walker.h"
 #include "platform/file_manager.h"
 #include "platform/paths.h"
+#include "platform/termination.h"
 #include "platform/utf8.h"
 
 namespace vtr {
@@ -114,8 +115,9 @@ class VTRManifest::Fill {
   Outcome processTreeItself(const std::string& treePath, const std::vector<std::string>& skip);
 
  private:
-  // Key, handler and progress for an item whose record was made (or not).
-  Outcome deliver(const std::string& path, const std::optional<VTRFileMetadata>& record);
+  // Key (from keyPath), handler and progress for the item at path whose
+  // record was made (or not).
+  Outcome deliver(const std::string& path, const std::string& keyPath, const std::optional<VTRFileMetadata>& record);
 
   const VTRManifest& manifest_;
   const Handler& handler_;
@@ -131,10 +133,14 @@ VTRManifest::Fill::Outcome VTRManifest::Fill::walk(const std::string& treePath,
       [&pipeline](const std::string& path, const Error& error) {
         pipeline.submitMessage(UnwalkableMessage(kFillErrorHandler, path, error));
       },
-      [&skip](const std::string& path) { return folder(skip, path); });
+      [&skip](const std::string& path) { return folder(skip, path); }, manifest_.treeLocation_);
 
   bool walking = true;
   for (;;) {
+    if (TerminationRequested()) {
+      VTRLog("Scan of %@ stopped: the helper is terminating", treePath);
+      return Outcome::kStopAnswerNo;
+    }
     while (walking && !pipeline.full()) {
       if (!walker.next()) {
         walking = false;
@@ -148,7 +154,7 @@ VTRManifest::Fill::Outcome VTRManifest::Fill::walk(const std::string& treePath,
     RecordPipeline::Item item = pipeline.take();
     for (const std::string& message : item.log) VTRLogModel::sharedInstance().logMessage(message);
     if (!item.wantsRecord) continue;
-    if (Outcome outcome = deliver(item.path, item.record); outcome != Outcome::kGoOn) return outcome;
+    if (Outcome outcome = deliver(item.path, item.path, item.record); outcome != Outcome::kGoOn) return outcome;
   }
 }
 
@@ -157,8 +163,11 @@ VTRManifest::Fill::Outcome VTRManifest::Fill::processTreeItself(const std::strin
   std::string path = treePath;
   while (path.size() > 1 && path.back() == '/') path.pop_back();
   if (folder(skip, path)) return Outcome::kGoOn;
+  const TreeLocation& location = manifest_.treeLocation_;
   struct stat st;
-  if (::lstat(path.c_str(), &st) != 0) {
+  const int statted = location.parent ? ::fstatat(location.parent->get(), location.name.c_str(), &st, AT_SYMLINK_NOFOLLOW)
+                                      : ::lstat(path.c_str(), &st);
+  if (statted != 0) {
     VTRLog("Could not get resource for key %@", "NSURLIsRegularFileKey");
     return Outcome::kStopAnswerNo;
   }
@@ -166,14 +175,18 @@ VTRManifest::Fill::Outcome VTRManifest::Fill::processTreeItself(const std::strin
     VTRLog("%@ is special file. Leave it along", path);
     return Outcome::kGoOn;
   }
-  return deliver(path, VTRFileMetadata::fileMetadatatWithPath(path));
+  // The key comes from the tree path as given: with its trailing slash it
+  // matches a root path spelled the same way, and the tree is keyed "/".
+  return deliver(path, treePath,
+                 location.parent ? VTRFileMetadata::initWithItemAt(location.parent->get(), location.name, path)
+                                 : VTRFileMetadata::fileMetadatatWithPath(path));
 }
 
-VTRManifest::Fill::Outcome VTRManifest::Fill::deliver(const std::string& path,
+VTRManifest::Fill::Outcome VTRManifest::Fill::deliver(const std::string& path, const std::string& keyPath,
                                                       const std::optional<VTRFileMetadata>& record) {
   // An item outside the root keeps the previous item's key, overwriting its
   // entry: long-standing behaviour that manifests in use rely on.
-  if (std::optional<std::string> key = RelativeKey(path, *manifest_.rootPath_)) previousKey_ = std::move(*key);
+  if (std::optional<std::string> key = RelativeKey(keyPath, *manifest_.rootPath_)) previousKey_ = std::move(*key);
   if (!record) {
     VTRLog("Couldn't get meta data for %@", path);
     return Outcome::kStopAnswerYes;
@@ -244,7 +257,8 @@ bool VTRManifest::enumerateAndCollectMetaData(const std::string& treePath, const
   }
   rootPath_ = rootPath;
   if (progressUpdater_ != nullptr) {
-    progressUpdater_->initializePercentageWithTotal(static_cast<int64_t>(calculateTotalFileSize(treePath, skip)));
+    progressUpdater_->initializePercentageWithTotal(
+        static_cast<int64_t>(calculateTotalFileSize(treePath, skip, treeLocation_)));
   }
   Fill fill(*this, handler);
   Fill::Outcome outcome = fill.walk(treePath, skip);
@@ -282,13 +296,14 @@ std::vector<std::string> VTRManifest::immediateHiddenFilesUnderPath(const std::s
   return hidden;
 }
 
-uint64_t VTRManifest::calculateTotalFileSize(const std::string& treePath, const std::vector<std::string>& skip) {
+uint64_t VTRManifest::calculateTotalFileSize(const std::string& treePath, const std::vector<std::string>& skip,
+                                             const TreeLocation& location) {
   TreeWalker walker(
       treePath,
       [](const std::string& path, const Error& error) {
         VTRLogModel::sharedInstance().logMessage(UnwalkableMessage(kTotalSizeErrorHandler, path, error));
       },
-      [&skip](const std::string& path) { return folder(skip, path); });
+      [&skip](const std::string& path) { return folder(skip, path); }, location);
   uint64_t total = 0;
   while (walker.next()) {
     if (walker.type() != TreeWalker::ItemType::kRegular) continue;

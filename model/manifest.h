@@ -57,6 +57,7 @@
 
 #include "model/file_metadata.h"
 #include "model/progress_updater.h"
+#include "model/tree_walker.h"
 #include "platform/value.h"
 
 namespace vtr {
@@ -95,6 +96,11 @@ class VTRManifest {
   // none. Not owned; must outlive the fills.
   VTRProgressUpdater* progressUpdater() const { return progressUpdater_; }
   void setProgressUpdater(VTRProgressUpdater* updater) { progressUpdater_ = updater; }
+
+  // Where the tree of the next fill stands, opened by the caller without
+  // following links; the tree path then only spells item paths and keys.
+  // Without it the tree path is resolved as text.
+  void setTreeLocation(TreeLocation location) { treeLocation_ = std::move(location); }
 
   // Worker threads that make records during a fill; 0 makes each record in
   // turn on the calling thread. The default suits the machine.
@@ -140,7 +146,8 @@ class VTRManifest {
   // skip list (the tree path itself never counts). Unwalkable parts are
   // logged and passed over; 0 after "Cound not get attribute for item %@"
   // when a file's size cannot be read.
-  static uint64_t calculateTotalFileSize(const std::string& treePath, const std::vector<std::string>& skip);
+  static uint64_t calculateTotalFileSize(const std::string& treePath, const std::vector<std::string>& skip,
+                                         const TreeLocation& location = {});
 
   // The size of the item at path as its attributes give it, 0 when they
   // cannot be read.
@@ -152,6 +159,7 @@ class VTRManifest {
   std::map<std::string, Value, std::less<>> entries_;
   std::optional<std::string> rootPath_;
   VTRProgressUpdater* progressUpdater_ = nullptr;
+  TreeLocation treeLocation_;
   unsigned recordThreads_;
 };
 

@@ -7,7 +7,15 @@
 namespace vtr {
 
 Result<std::unique_ptr<ManifestFileWriter>> ManifestFileWriter::Create(const std::string& path, mode_t mode) {
-  Result<AtomicFile> file = AtomicFile::Create(path, mode);
+  return Make(AtomicFile::Create(path, mode), path);
+}
+
+Result<std::unique_ptr<ManifestFileWriter>> ManifestFileWriter::CreateIn(UniqueFd dir, const std::string& path,
+                                                                         mode_t mode) {
+  return Make(AtomicFile::CreateIn(std::move(dir), path, mode), path);
+}
+
+Result<std::unique_ptr<ManifestFileWriter>> ManifestFileWriter::Make(Result<AtomicFile> file, const std::string& path) {
   if (!file.ok()) return file.error();
   struct stat st;
   if (::fstat(file->fd(), &st) != 0) return Error::FromErrno(path);

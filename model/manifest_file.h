@@ -33,6 +33,9 @@ class ManifestFileWriter {
   // Opens the temporary file for path (whose directory must exist). Fails
   // when it cannot be created.
   static Result<std::unique_ptr<ManifestFileWriter>> Create(const std::string& path, mode_t mode = 0644);
+  // The same in the open directory dir (see AtomicFile::CreateIn).
+  static Result<std::unique_ptr<ManifestFileWriter>> CreateIn(UniqueFd dir, const std::string& path,
+                                                              mode_t mode = 0644);
   ManifestFileWriter(const ManifestFileWriter&) = delete;
   ManifestFileWriter& operator=(const ManifestFileWriter&) = delete;
 
@@ -57,6 +60,7 @@ class ManifestFileWriter {
   std::string temporaryPath() const { return file_.temporaryPath(); }
 
  private:
+  static Result<std::unique_ptr<ManifestFileWriter>> Make(Result<AtomicFile> file, const std::string& path);
   ManifestFileWriter(AtomicFile file, int64_t device, uint64_t inode);
   // Whether record describes the temporary file being written.
   bool isOwnFile(const VTRFileMetadata& record) const;

@@ -33,8 +33,8 @@ bool IsDotOrDotDot(const char* name) {
 
 }  // namespace
 
-TreeWalker::TreeWalker(std::string root, ErrorHandler onError, SkipRule skip)
-    : root_(std::move(root)), onError_(std::move(onError)), skip_(std::move(skip)) {}
+TreeWalker::TreeWalker(std::string root, ErrorHandler onError, SkipRule skip, TreeLocation location)
+    : root_(std::move(root)), location_(std::move(location)), onError_(std::move(onError)), skip_(std::move(skip)) {}
 
 const std::string& TreeWalker::name() const {
   const Level& level = levels_.back();
@@ -50,7 +50,11 @@ void TreeWalker::openRoot() {
   // paths read as the caller named the tree.
   std::string rootPath = root_;
   while (rootPath.size() > 1 && rootPath.back() == '/') rootPath.pop_back();
-  enter(AT_FDCWD, root_, rootPath);
+  if (location_.parent) {
+    enter(location_.parent->get(), location_.name, rootPath);
+  } else {
+    enter(AT_FDCWD, root_, rootPath);
+  }
 }
 
 void TreeWalker::enter(int parentFd, const std::string& name, const std::string& path) {

@@ -44,6 +44,14 @@ namespace vtr {
 // helper holds it stays well under the usual limit of 1024 open files.
 inline constexpr size_t kMaxWalkDepth = 512;
 
+// Where a tree stands when its path is not to be resolved as text: the entry
+// name of an open directory (a client's path, opened without following
+// links). Empty (no parent) means "resolve the path".
+struct TreeLocation {
+  std::shared_ptr<const UniqueFd> parent;
+  std::string name;
+};
+
 class TreeWalker {
  public:
   enum class ItemType : uint8_t { kRegular, kDirectory, kSymbolicLink, kOther };
@@ -58,7 +66,9 @@ class TreeWalker {
   // are root joined with the names below it by single slashes (a trailing
   // slash of root is dropped). The handlers must outlive the walker; skip may
   // be empty.
-  TreeWalker(std::string root, ErrorHandler onError, SkipRule skip = nullptr);
+  // With a location, the root is opened as that entry (no link followed)
+  // and root serves only as the text of item paths.
+  TreeWalker(std::string root, ErrorHandler onError, SkipRule skip = nullptr, TreeLocation location = {});
   TreeWalker(const TreeWalker&) = delete;
   TreeWalker& operator=(const TreeWalker&) = delete;
 
@@ -104,6 +114,7 @@ class TreeWalker {
   bool typeOf(const Level& level, const Entry& entry, ItemType* type);
 
   std::string root_;
+  TreeLocation location_;
   ErrorHandler onError_;
   SkipRule skip_;
   bool started_ = false;

@@ -7,6 +7,7 @@
 #include <mutex>
 #include <utility>
 
+#include "platform/read_fully.h"
 #include "platform/unique_fd.h"
 
 namespace vtr {
@@ -21,17 +22,9 @@ Result<std::string> ReadAccountFile(const std::string& path) {
   if (::fstat(fd.get(), &st) != 0) return Error::FromErrno(path);
   if (!S_ISREG(st.st_mode)) return Error(EINVAL, path + " is not a regular file");
   if (static_cast<uint64_t>(st.st_size) > kMaxAccountFileBytes) return Error(EFBIG, path);
-  std::string text;
-  char chunk[65536];
-  for (;;) {
-    const ssize_t n = ::read(fd.get(), chunk, sizeof chunk);
-    if (n < 0 && errno == EINTR) continue;
-    if (n < 0) return Error::FromErrno(path);
-    if (n == 0) return text;
-    // Checked per chunk as well: the file may grow while it is read.
-    if (text.size() + static_cast<size_t>(n) > kMaxAccountFileBytes) return Error(EFBIG, path);
-    text.append(chunk, static_cast<size_t>(n));
-  }
+  Result<std::string> text = ReadFully(fd.get(), kMaxAccountFileBytes);
+  if (!text.ok()) return Error(text.error().code(), path);
+  return text;
 }
 
 // A decimal id below 2^32-1 ((uid_t)-1 means "no id" to the kernel).

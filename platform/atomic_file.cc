@@ -29,7 +29,14 @@ Result<AtomicFile> AtomicFile::Create(const std::string& path, mode_t mode) {
 
   UniqueFd dirFd(::open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (!dirFd) return Error::FromErrno(dir);
+  return CreateIn(std::move(dirFd), path, mode);
+}
 
+Result<AtomicFile> AtomicFile::CreateIn(UniqueFd dirFd, const std::string& path, mode_t mode) {
+  const size_t slash = path.rfind('/');
+  const std::string dir = slash == std::string::npos ? "." : path.substr(0, slash);
+  const std::string name = slash == std::string::npos ? path : path.substr(slash + 1);
+  if (name.empty() || name == "." || name == "..") return Error(EINVAL, path);
   for (int attempt = 0; attempt < 100; ++attempt) {
     std::string temp = "." + name + "." + RandomSuffix();
     UniqueFd fd(::openat(dirFd.get(), temp.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, mode));

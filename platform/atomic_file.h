@@ -21,6 +21,9 @@ class AtomicFile {
   // (which must exist; it is not created). The target is not touched until
   // commit(). A symbolic link at the target is replaced, never followed.
   static Result<AtomicFile> Create(const std::string& path, mode_t mode = 0644);
+  // The same in the directory dir, already open (no path is resolved): the
+  // target is the entry named by path's last component.
+  static Result<AtomicFile> CreateIn(UniqueFd dir, const std::string& path, mode_t mode = 0644);
 
   AtomicFile(AtomicFile&& other) noexcept;
   AtomicFile& operator=(AtomicFile&&) = delete;

@@ -13,9 +13,11 @@ Date CreationDateFromStatx(const struct statx& stx) {
   return ModificationDateFromStatx(stx);
 }
 
-std::optional<Date> CreationDateOfItem(const std::string& path) {
+std::optional<Date> CreationDateOfItem(const std::string& path) { return CreationDateOfItemAt(AT_FDCWD, path); }
+
+std::optional<Date> CreationDateOfItemAt(int dirFd, const std::string& name) {
   struct statx stx;
-  if (::statx(AT_FDCWD, path.c_str(), AT_SYMLINK_NOFOLLOW, STATX_BTIME | STATX_MTIME, &stx) != 0) {
+  if (::statx(dirFd, name.c_str(), AT_SYMLINK_NOFOLLOW, STATX_BTIME | STATX_MTIME, &stx) != 0) {
     return std::nullopt;
   }
   return CreationDateFromStatx(stx);

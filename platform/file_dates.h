@@ -15,6 +15,8 @@ namespace vtr {
 // followed): its birth time where the file system records one, else its
 // modification time. nullopt when the item cannot be examined.
 std::optional<Date> CreationDateOfItem(const std::string& path);
+// The same for the entry name of the open directory dirFd.
+std::optional<Date> CreationDateOfItemAt(int dirFd, const std::string& name);
 
 // The same choice over statx results already read (the birth time only when
 // the mask says the file system filled it in).

@@ -5,12 +5,14 @@
 #include <fcntl.h>
 #include <limits.h>
 #include <sys/stat.h>
+#include <sys/statvfs.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cstdio>
 
 #include "platform/file_tree.h"
+#include "platform/format.h"
 #include "platform/make_directories.h"
 
 namespace vtr {
@@ -60,21 +62,41 @@ Status Replicate(const std::string& src, const std::string& dst, Replication mod
 
 }  // namespace
 
-Status MoveItem(const std::string& src, const std::string& dst) {
-  if (::renameat2(AT_FDCWD, src.c_str(), AT_FDCWD, dst.c_str(), RENAME_NOREPLACE) == 0) return Status::Ok();
+Status MoveItemAt(int srcDir, const std::string& srcName, int dstDir, const std::string& dstName,
+                  const std::string& srcPath, const std::string& dstPath) {
+  const char* from = srcName.c_str();
+  const char* to = dstName.c_str();
+  if (::renameat2(srcDir, from, dstDir, to, RENAME_NOREPLACE) == 0) return Status::Ok();
   if (errno == EINVAL) {
     // Some file systems cannot rename without replacing; check first there
     // (EINVAL also means moving a directory into itself, which rename
     // refuses again below).
     struct stat st;
-    if (::lstat(dst.c_str(), &st) == 0) return Error(EEXIST, dst);
-    if (::rename(src.c_str(), dst.c_str()) == 0) return Status::Ok();
+    if (::fstatat(dstDir, to, &st, AT_SYMLINK_NOFOLLOW) == 0) return Error(EEXIST, dstPath);
+    if (::renameat(srcDir, from, dstDir, to) == 0) return Status::Ok();
   }
-  if (errno == EEXIST) return Error::FromErrno(dst);
-  if (errno != EXDEV) return Error::FromErrno(src);
-  Status copied = Replicate(src, dst, Replication::kCopy);
+  if (errno == EEXIST) return Error::FromErrno(dstPath);
+  if (errno != EXDEV) return Error::FromErrno(srcPath);
+  // Across file systems: a copy, made only when it fits (holes take no
+  // room), then the source goes. A copy that fails is removed again and the
+  // source stays as it was.
+  Result<uint64_t> needed = AllocatedBytesOfTree(srcDir, srcName, srcPath);
+  if (!needed.ok()) return needed.error();
+  struct statvfs room;
+  if (::fstatvfs(dstDir, &room) == 0 && uint64_t{room.f_bavail} * room.f_frsize < *needed) {
+    return Error(ENOSPC, Format("%s needs %llu bytes", dstPath.c_str(), static_cast<unsigned long long>(*needed)));
+  }
+  Status copied = ReplicateItem(srcDir, srcName, dstDir, dstName, Replication::kCopy, srcPath, dstPath);
   if (!copied.ok()) return copied;
-  return RemoveItem(src);
+  return RemoveItemAt(srcDir, srcName, srcPath);
+}
+
+Status MoveItem(const std::string& src, const std::string& dst) {
+  Result<ParentAndName> from = OpenParent(src);
+  if (!from.ok()) return from.error();
+  Result<ParentAndName> to = OpenParent(dst);
+  if (!to.ok()) return to.error();
+  return MoveItemAt(from->parent.get(), from->name, to->parent.get(), to->name, src, dst);
 }
 
 Status LinkItem(const std::string& src, const std::string& dst) {

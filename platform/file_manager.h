@@ -141,6 +141,14 @@ Status CreateDirectory(const std::string& path, bool withIntermediateDirectories
 // both stay and its error is returned.
 Status MoveItem(const std::string& src, const std::string& dst);
 
+// MoveItem of the entry srcName of srcDir to the entry dstName of dstDir,
+// nothing resolved but those two names. Across file systems the copy keeps
+// holes, is made only when the destination has room for it (ENOSPC
+// otherwise, before anything is written) and the source is removed only
+// once the copy is whole.
+Status MoveItemAt(int srcDir, const std::string& srcName, int dstDir, const std::string& dstName,
+                  const std::string& srcPath, const std::string& dstPath);
+
 // Makes dst a hard link of src, which must not exist (EEXIST otherwise). For
 // a directory, dst is a new directory tree with the source's directories
 // recreated (mode, owner, times, extended attributes), its files hard-linked

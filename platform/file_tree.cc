@@ -16,6 +16,7 @@
 #include <memory>
 
 #include "platform/file_manager.h"
+#include "platform/output_stream.h"
 #include "platform/remove_item.h"
 
 // fchmodat2 (Linux 6.6) has the same number on every architecture; the C
@@ -121,30 +122,53 @@ Status CopyMetadataAt(const Node& dst, const struct statx& st) {
   return Status::Ok();
 }
 
-Status CopyData(int from, int to, const std::string& srcPath, const std::string& dstPath) {
-  for (;;) {
-    const ssize_t n = ::copy_file_range(from, nullptr, to, nullptr, kCopyBufferBytes, 0);
-    if (n == 0) return Status::Ok();
+// Copies [begin, end) of from to the same offsets of to: copy_file_range
+// where the kernel can, read and write where it cannot.
+Status CopyRange(int from, int to, off_t begin, off_t end, const std::string& srcPath, const std::string& dstPath) {
+  off_t in = begin, out = begin;
+  while (in < end) {
+    const size_t want = static_cast<size_t>(std::min<off_t>(end - in, static_cast<off_t>(kCopyBufferBytes)));
+    const ssize_t n = ::copy_file_range(from, &in, to, &out, want, 0);
     if (n > 0) continue;
+    if (n == 0) return Status::Ok();  // the file shrank: what is left is copied as it is now
     if (errno == EINTR) continue;
     if (errno == EXDEV || errno == EINVAL || errno == ENOSYS || errno == EOPNOTSUPP) break;
-    return Error::FromErrno(srcPath);
+    return Error::FromErrno(errno == ENOSPC || errno == EDQUOT ? dstPath : srcPath);
   }
-  // The kernel cannot copy between these two file systems: copy by hand
-  // from where it stopped (both offsets have advanced alike).
   std::unique_ptr<char[]> buffer(new char[kCopyBufferBytes]);
-  for (;;) {
-    const ssize_t n = ::read(from, buffer.get(), kCopyBufferBytes);
+  while (in < end) {
+    const size_t want = static_cast<size_t>(std::min<off_t>(end - in, static_cast<off_t>(kCopyBufferBytes)));
+    const ssize_t n = ::pread(from, buffer.get(), want, in);
     if (n < 0 && errno == EINTR) continue;
     if (n < 0) return Error::FromErrno(srcPath);
     if (n == 0) return Status::Ok();
-    for (ssize_t written = 0; written < n;) {
-      const ssize_t w = ::write(to, buffer.get() + written, static_cast<size_t>(n - written));
-      if (w < 0 && errno == EINTR) continue;
-      if (w < 0) return Error::FromErrno(dstPath);
-      written += w;
-    }
+    if (Status s = WriteFullyAt(to, buffer.get(), static_cast<size_t>(n), in); !s.ok()) return Error(s.error().code(), dstPath);
+    in += n;
   }
+  return Status::Ok();
+}
+
+// Copies the first size bytes of from (its size when it was opened: the copy
+// never reads past it, however the file grows) to to, keeping holes holes:
+// only the data regions SEEK_DATA finds are copied, and the length is set
+// at the end. A file system without SEEK_DATA is copied whole.
+Status CopyData(int from, int to, off_t size, const std::string& srcPath, const std::string& dstPath) {
+  off_t at = 0;
+  while (at < size) {
+    const off_t data = ::lseek(from, at, SEEK_DATA);
+    if (data < 0 && errno == ENXIO) break;  // only a hole is left
+    if (data < 0) {
+      if (Status s = CopyRange(from, to, at, size, srcPath, dstPath); !s.ok()) return s;
+      break;
+    }
+    if (data >= size) break;
+    off_t hole = ::lseek(from, data, SEEK_HOLE);
+    if (hole < 0 || hole > size) hole = size;
+    if (Status s = CopyRange(from, to, data, hole, srcPath, dstPath); !s.ok()) return s;
+    at = hole;
+  }
+  if (::ftruncate(to, size) != 0) return Error::FromErrno(dstPath);
+  return Status::Ok();
 }
 
 Status ReplicateNode(const Node& src, const Node& dst, Replication mode, int depth, bool* created);
@@ -190,7 +214,7 @@ Status CopyFile(const Node& src, const Node& dst, bool* created) {
   UniqueFd to(::openat(dst.dir, dst.name.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600));
   if (!to) return Error::FromErrno(dst.path);
   *created = true;
-  Status data = CopyData(from.get(), to.get(), src.path, dst.path);
+  Status data = CopyData(from.get(), to.get(), static_cast<off_t>(st->stx_size), src.path, dst.path);
   if (!data.ok()) return data;
   return CopyMetadata(from.get(), to.get(), *st, src.path, dst.path);
 }
@@ -230,7 +254,29 @@ Status ReplicateNode(const Node& src, const Node& dst, Replication mode, int dep
   return CopySpecialFile(dst, *st, created);
 }
 
+Result<uint64_t> AllocatedBytes(int dir, const std::string& name, const std::string& path, int depth) {
+  Result<struct statx> st = StatNode(dir, name.c_str(), 0, path);
+  if (!st.ok()) return st.error();
+  uint64_t total = st->stx_blocks * 512;
+  if (!S_ISDIR(st->stx_mode)) return total;
+  if (depth >= kMaxTreeDepth) return Error(ELOOP, path);
+  UniqueFd fd(::openat(dir, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  if (!fd) return Error::FromErrno(path);
+  Result<std::vector<std::string>> names = DirectoryEntryNames(fd.get(), path);
+  if (!names.ok()) return names.error();
+  for (const std::string& child : *names) {
+    Result<uint64_t> bytes = AllocatedBytes(fd.get(), child, path + "/" + child, depth + 1);
+    if (!bytes.ok()) return bytes;
+    total += *bytes;
+  }
+  return total;
+}
+
 }  // namespace
+
+Result<uint64_t> AllocatedBytesOfTree(int dirFd, const std::string& name, const std::string& pathForErrors) {
+  return AllocatedBytes(dirFd, name, pathForErrors, 0);
+}
 
 Result<ParentAndName> OpenParent(const std::string& path) {
   std::string trimmed = path;

@@ -46,6 +46,11 @@ ssize_t ListExtendedAttributesAt(int dirFd, const std::string& name, char* list,
 ssize_t GetExtendedAttributeAt(int dirFd, const std::string& name, const std::string& key, void* value,
                                size_t size, const std::string* fallbackPath);
 
+// The bytes the entry name of dirFd and everything below it take on disk
+// (allocated blocks, so holes count nothing), links never followed. What a
+// copy of it will need at least.
+Result<uint64_t> AllocatedBytesOfTree(int dirFd, const std::string& name, const std::string& pathForErrors);
+
 // How ReplicateItem makes the files of the copy.
 enum class Replication {
   kCopy,      // new files with the source's data, mode, owner, times and extended attributes
@@ -56,7 +61,9 @@ enum class Replication {
 // not exist. Directories are recreated entry by entry, with the source's
 // mode, owner, times and extended attributes; symbolic links are recreated
 // with their target text, owner and times; files (and special files) are
-// copied or hard-linked as the mode says. Nothing is followed. Ownership
+// copied or hard-linked as the mode says. A copy keeps holes (only data
+// regions are written) and reads a file no further than its size when it was
+// opened. Nothing is followed. Ownership
 // that the caller may not give (EPERM when not root) and extended attributes
 // that the destination cannot hold are passed over. On failure, whatever was
 // made at dstName is removed again. Nesting deeper than kMaxTreeDepth fails

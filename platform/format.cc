@@ -1,5 +1,6 @@
 #include "platform/format.h"
 
+#include <algorithm>
 #include <cstdio>
 
 namespace vtr {
@@ -113,6 +114,45 @@ std::string FormatArgs(std::string_view fmt, Arg* args, size_t count) {
     }
   }
   return out;
+}
+
+}  // namespace format_detail
+
+std::string EscapeControlCharacters(std::string_view text) {
+  static constexpr char kHex[] = "0123456789abcdef";
+  std::string out;
+  out.reserve(text.size());
+  for (const char c : text) {
+    const auto u = static_cast<unsigned char>(c);
+    if (u >= 0x20 && u != 0x7f) {
+      out += c;
+    } else if (c == '\n') {
+      out += "\\n";
+    } else if (c == '\t') {
+      out += "\\t";
+    } else if (c == '\r') {
+      out += "\\r";
+    } else {
+      out += "\\x";
+      out += kHex[u >> 4];
+      out += kHex[u & 15];
+    }
+  }
+  return out;
+}
+
+namespace format_detail {
+
+void EscapeControlCharacters(Arg* arg) {
+  if (arg->kind != Arg::kText) return;
+  // An object's description is in owned, a string's text in text.
+  const std::string_view text = arg->owned.empty() ? arg->text : std::string_view(arg->owned);
+  const bool clean = std::all_of(text.begin(), text.end(), [](char c) {
+    const auto u = static_cast<unsigned char>(c);
+    return u >= 0x20 && u != 0x7f;
+  });
+  if (clean) return;
+  arg->owned = vtr::EscapeControlCharacters(text);
 }
 
 }  // namespace format_detail

@@ -195,6 +195,9 @@ Arg MakeArg(const T& v) {
 
 std::string FormatArgs(std::string_view fmt, Arg* args, size_t count);
 
+// Replaces a text argument by its text with control characters escaped.
+void EscapeControlCharacters(Arg* arg);
+
 }  // namespace format_detail
 
 // A format string checked against the argument types Args at compile time.
@@ -218,6 +221,19 @@ std::string Format(FormatString<std::type_identity_t<Args>...> fmt, const Args&.
   format_detail::Arg converted[] = {format_detail::MakeArg(args)..., format_detail::Arg()};
   return format_detail::FormatArgs(fmt.text(), converted, sizeof...(Args));
 }
+
+// Format, with the control characters in the text of every argument (a
+// string, or the description of an object) escaped as \n, \t, \r or \xNN:
+// what the logs write, so that no value can start a line of its own.
+template <typename... Args>
+std::string FormatEscaped(FormatString<std::type_identity_t<Args>...> fmt, const Args&... args) {
+  format_detail::Arg converted[] = {format_detail::MakeArg(args)..., format_detail::Arg()};
+  for (format_detail::Arg& arg : converted) format_detail::EscapeControlCharacters(&arg);
+  return format_detail::FormatArgs(fmt.text(), converted, sizeof...(Args));
+}
+
+// text with its control characters (below 0x20, and 0x7f) escaped as above.
+std::string EscapeControlCharacters(std::string_view text);
 
 }  // namespace vtr
 

@@ -6,16 +6,19 @@
 
 namespace vtr {
 
-Status WriteFully(int fd, const void* bytes, size_t length) {
+Status WriteFully(int fd, const void* bytes, size_t length) { return WriteFullyAt(fd, bytes, length, -1); }
+
+Status WriteFullyAt(int fd, const void* bytes, size_t length, off_t offset) {
   const auto* p = static_cast<const uint8_t*>(bytes);
   while (length > 0) {
-    const ssize_t n = ::write(fd, p, length);
+    const ssize_t n = offset < 0 ? ::write(fd, p, length) : ::pwrite(fd, p, length, offset);
     if (n < 0) {
       if (errno == EINTR) continue;
       return Error::FromErrno("write");
     }
     p += n;
     length -= static_cast<size_t>(n);
+    if (offset >= 0) offset += n;
   }
   return Status::Ok();
 }

@@ -3,6 +3,8 @@
 #ifndef VTR_PLATFORM_OUTPUT_STREAM_H_
 #define VTR_PLATFORM_OUTPUT_STREAM_H_
 
+#include <sys/types.h>
+
 #include <cstddef>
 #include <cstdint>
 #include <vector>
@@ -59,6 +61,8 @@ class MemoryOutputStream final : public OutputStream {
 
 // Writes all of length bytes to fd, retrying short writes and EINTR.
 Status WriteFully(int fd, const void* bytes, size_t length);
+// The same at offset (pwrite), or at the file's offset when offset is -1.
+Status WriteFullyAt(int fd, const void* bytes, size_t length, off_t offset);
 
 }  // namespace vtr
 

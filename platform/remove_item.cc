@@ -15,8 +15,15 @@ namespace {
 
 Status RemoveAt(int dirFd, const std::string& name, const std::string& path, int depth) {
   if (::unlinkat(dirFd, name.c_str(), 0) == 0) return Status::Ok();
-  if (errno != EISDIR && errno != EPERM) return Error::FromErrno(path);
-  // A directory (EISDIR on Linux; EPERM where unlink of a directory is refused).
+  const int unlinkError = errno;
+  // A directory gives EISDIR on Linux, EPERM where unlink of a directory is
+  // refused; EPERM also means an immutable or append-only file, whose own
+  // error is the one to report.
+  struct stat st;
+  if (unlinkError != EISDIR &&
+      (unlinkError != EPERM || ::fstatat(dirFd, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0 || !S_ISDIR(st.st_mode))) {
+    return Error(unlinkError, path);
+  }
   if (depth >= kMaxRemoveDepth) return Error(ELOOP, path);
   UniqueFd fd(::openat(dirFd, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
   if (!fd) return Error::FromErrno(path);

@@ -3,11 +3,14 @@
 
 #include <cstdio>
 #include <cstring>
+#include <ctime>
 #include <string>
 
 #include "model/log.h"
 #include "model/progress_updater.h"
+#include "vitd_helper/client_areas.h"
 #include "vitd_helper/message_responder.h"
+#include "vitd_helper/operations.h"
 #include "vitd_helper/sandbox.h"
 #include "vitd_helper/service.h"
 #include "xpc/peer_identity.h"
@@ -76,6 +79,9 @@ int main(int argc, char** argv) {
   VTRLogModel& logModel = VTRLogModel::sharedInstance();
   if (options.toStderr) logModel.setSystemLog(MakeStderrLog());
 
+  // The local time zone is read now: inside a sandbox root /etc/localtime
+  // may be missing, and the day's log file is named by the local date.
+  ::tzset();
   Result<UniqueFd> proc = options.root.empty() ? OpenProcDirectory("/proc") : EnterSandboxRoot(options.root);
   if (!proc.ok()) {
     std::fprintf(stderr, "vitd_helper: cannot set up %s: %s\n", options.root.empty() ? "/proc" : options.root.c_str(),
@@ -83,12 +89,22 @@ int main(int argc, char** argv) {
     return 1;
   }
 
+  // Where client paths may lie; a file anyone but root could have written
+  // is no basis to serve on.
+  Result<ClientAreas> areas = ClientAreas::Load(VTRHOperations::sharedInstance().resolver().root());
+  if (!areas.ok()) {
+    VTRLog("Refusing to start: %@", areas.error().message());
+    std::fprintf(stderr, "vitd_helper: refusing to start: %s\n", areas.error().message().c_str());
+    return 1;
+  }
+  VTRHOperations::sharedInstance().setClientAreas(std::move(areas).value());
+
   VTRLog("%s started", argv[0]);
   (void)logModel.enableLogToFilesUnder("/private/var/logs/vitd", "vitd_helper", 5);
 
   VTRProgressUpdater::sharedInstance().setSender(
       [](int64_t percent) { VTRHMessageResponder::sharedInstance().sendProgress(percent); });
 
-  CreateXPCListener(std::move(proc).value());
-  RunService();
+  HelperService service(std::move(proc).value());
+  return service.run();
 }

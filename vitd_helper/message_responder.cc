@@ -8,7 +8,6 @@
 namespace vtr {
 namespace {
 
-constexpr char kEntitlement[] = "com.orvane.private.vitrell.vitrelld";
 constexpr char kHasEntitlementMethod[] = "-[VTRHMessageResponder hasEntitlementVitrelld]";
 constexpr char kResponderClass[] = "VTRHMessageResponder";
 
@@ -20,13 +19,13 @@ VTRHMessageResponder& VTRHMessageResponder::sharedInstance() {
 }
 
 bool VTRHMessageResponder::hasEntitlementVitrelld() {
-  std::shared_ptr<Connection> current = connection();
-  Result<SecTask> task = current ? SecTask::CreateWithPeer(current->peer()) : Result<SecTask>(Error(ESRCH, ""));
+  std::shared_ptr<MessagePeer> current = connection();
+  Result<SecTask> task = current ? current->copyTask() : Result<SecTask>(Error(ESRCH, ""));
   if (!task.ok()) {
     VTRLog("%s: Cannot create SecTask from audit token", kHasEntitlementMethod);
     return false;
   }
-  const Value value = task->copyValueForEntitlement(kEntitlement);
+  const Value value = task->copyValueForEntitlement(kVitrelldEntitlement);
   if (value.isNil()) {
     VTRLog("%s: No data received.", kHasEntitlementMethod);
     return false;
@@ -44,6 +43,7 @@ void VTRHMessageResponder::handleXPCMessage(const XpcObject& request) {
     VTRLog("The client does not have proper entitlement");
     return;
   }
+  ScopedLogPeer entitled(std::nullopt);
   const Value converted = XPCDictionaryConversion::dictionaryWithXPCDictionary(request);
   const Dictionary* commands = converted.dictionary();
   if (commands == nullptr) return;
@@ -67,7 +67,7 @@ void VTRHMessageResponder::handleXPCMessage(const XpcObject& request) {
 }
 
 void VTRHMessageResponder::send(const char* key, XpcObject value) {
-  std::shared_ptr<Connection> current = connection();
+  std::shared_ptr<MessagePeer> current = connection();
   if (!current) return;  // the client is gone: the message is dropped
   (void)current->send(XpcObject::Dictionary({{key, std::move(value)}}));
 }

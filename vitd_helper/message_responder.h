@@ -18,19 +18,26 @@
 #include <string>
 
 #include "platform/value.h"
-#include "xpc/connection.h"
+#include "xpc/message_peer.h"
 #include "xpc/xpc_object.h"
 
 namespace vtr {
+
+// The entitlement a client needs, with the boolean value true.
+inline constexpr char kVitrelldEntitlement[] = "com.orvane.private.vitrell.vitrelld";
 
 class VTRHMessageResponder {
  public:
   static VTRHMessageResponder& sharedInstance();
 
-  // The connection of the latest request; null once that client is gone.
-  // The responder never keeps a connection alive (the reference is weak).
-  std::shared_ptr<Connection> connection() const { return connection_.lock(); }
-  void setConnection(std::weak_ptr<Connection> connection) { connection_ = std::move(connection); }
+  // Only a boolean true grants access; a string or a number does not.
+  static bool GrantsEntitlement(const Value& value) { return value.boolean().value_or(false); }
+
+  // The peer of the latest request (a connection, or a test's own); null
+  // once that client is gone. The responder never keeps it alive (the
+  // reference is weak).
+  std::shared_ptr<MessagePeer> connection() const { return connection_.lock(); }
+  void setConnection(std::weak_ptr<MessagePeer> connection) { connection_ = std::move(connection); }
 
   // True when the process behind the current connection holds the entitlement
   // "com.orvane.private.vitrell.vitrelld" with the boolean value true.
@@ -38,7 +45,8 @@ class VTRHMessageResponder {
   bool hasEntitlementVitrelld();
 
   // Handles one request dictionary (see above). Sends nothing to a client
-  // without the entitlement.
+  // without the entitlement. The command's lines are not rate-limited as the
+  // peer's: an entitled client's work logs what it must.
   void handleXPCMessage(const XpcObject& request);
 
   // The four messages, sent on the current connection; dropped when there is
@@ -62,7 +70,7 @@ class VTRHMessageResponder {
  private:
   void send(const char* key, XpcObject value);
 
-  std::weak_ptr<Connection> connection_;
+  std::weak_ptr<MessagePeer> connection_;
 };
 
 }  // namespace vtr

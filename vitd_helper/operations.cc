@@ -1,91 +1,185 @@
+// The preferences and container work of VTRHOperations.
 #include "vitd_helper/operations.h"
 
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
 #include "model/log.h"
+#include "platform/accounts.h"
 #include "platform/file_manager.h"
+#include "platform/file_tree.h"
+#include "platform/open_beneath.h"
 #include "platform/paths.h"
 
 namespace vtr {
 namespace {
 
-constexpr char kRootPreferencesFolder[] = "/var/root/Library/Preferences/";
-constexpr char kMobilePreferencesFolder[] = "/var/mobile/Library/Preferences/";
-constexpr char kPreferencesFileName[] = "com.orvane.Vitrell.plist";
-constexpr char kMobileAccount[] = "mobile";
-constexpr char kStagingFolderName[] = "VTR_staging";
-constexpr char kLogFilePrefix[] = "vitd-";
 constexpr char kPrepareDirectoryMethod[] = "-[VTRHOperations prepareDirectory:writableByMobile:]";
 
-// Owner and group "mobile", by account name.
-Status GiveToMobile(const std::string& path) {
-  const Value owner = Value::String(kMobileAccount);
-  return SetAttributes(Dictionary({{kNSFileOwnerAccountName, owner}, {kNSFileGroupOwnerAccountName, owner}}), path);
+// Owner and group of the item open as fd (O_PATH will do) become the
+// account's, by name. Only a directory, or a regular file with one link, is
+// handed over: a hard link would hand over an inode that lives elsewhere
+// too, as systemd-tmpfiles refuses to; a link or special file is never.
+Status GiveToAccount(int fd, const std::string& account, const std::string& path) {
+  struct stat st;
+  if (::fstat(fd, &st) != 0) return Error::FromErrno(path);
+  if (!S_ISDIR(st.st_mode) && !S_ISREG(st.st_mode)) return Error(EPERM, path + " is neither a file nor a directory");
+  if (S_ISREG(st.st_mode) && st.st_nlink > 1) return Error(EMLINK, path + " has more than one link");
+  std::shared_ptr<const AccountDatabase> accounts = AccountDatabase::Shared();
+  const std::optional<uid_t> uid = accounts->userId(account);
+  const std::optional<gid_t> gid = accounts->groupId(account);
+  if (!uid || !gid) return Error(EINVAL, "no account " + account);
+  if (::fchownat(fd, "", *uid, *gid, AT_EMPTY_PATH) != 0) return Error::FromErrno(path);
+  return Status::Ok();
+}
+
+bool EntryExists(int dirFd, const std::string& name) {
+  struct stat st;
+  return ::fstatat(dirFd, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0;
 }
 
 }  // namespace
 
 VTRHOperations& VTRHOperations::sharedInstance() {
-  static VTRHOperations* const instance = new VTRHOperations();
+  static VTRHOperations* const instance = [] {
+    auto root = std::make_shared<const UniqueFd>(::open("/", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    return new VTRHOperations(HelperPaths(), ClientPathResolver(ClientAreas::Defaults(), std::move(root)));
+  }();
   return *instance;
 }
 
+VTRHOperations::VTRHOperations(HelperPaths paths, ClientPathResolver resolver)
+    : paths_(std::move(paths)), resolver_(std::move(resolver)) {}
+
+void VTRHOperations::setClientAreas(ClientAreas areas) {
+  resolver_ = ClientPathResolver(std::move(areas), resolver_.rootDirectory());
+}
+
+std::optional<CheckedPath> VTRHOperations::checkClientPath(const std::string& path, ClientUse use) const {
+  Result<CheckedPath> checked = resolver_.check(path, use);
+  if (!checked.ok()) {
+    LogRefusal(path, checked.error());
+    return std::nullopt;
+  }
+  return std::move(*checked);
+}
+
 bool VTRHOperations::migratePreferencesFile() {
-  const std::string source = AppendPathComponent(kRootPreferencesFolder, kPreferencesFileName);
-  const std::string target = AppendPathComponent(kMobilePreferencesFolder, kPreferencesFileName);
-  if (!FileExists(source) || FileExists(target)) return false;
-  if (!MoveItem(source, target).ok()) {
+  const std::string& name = paths_.preferencesFileName;
+  const std::string source = AppendPathComponent(paths_.rootPreferencesFolder, name);
+  const std::string target = AppendPathComponent(paths_.mobilePreferencesFolder, name);
+  Result<CheckedPath> sourceFolder = ClientPathResolver::CheckFixed(paths_.rootPreferencesFolder);
+  Result<CheckedPath> targetFolder = ClientPathResolver::CheckFixed(paths_.mobilePreferencesFolder);
+  if (!sourceFolder.ok() || !targetFolder.ok()) return false;
+  // Nothing to move is no failure worth a line; a link on the way is.
+  Result<UniqueFd> from = resolver_.openDirectory(*sourceFolder);
+  if (!from.ok()) {
+    if (from.error().code() != ENOENT) LogRefusal(source, from.error());
+    return false;
+  }
+  if (!EntryExists(from->get(), name)) return false;
+  Result<UniqueFd> to = resolver_.openDirectory(*targetFolder);
+  if (!to.ok() && to.error().code() != ENOENT) {
+    LogRefusal(target, to.error());
+    return false;
+  }
+  if (to.ok() && EntryExists(to->get(), name)) return false;
+  Result<UniqueFd> file = OpenEntryNoFollow(from->get(), name, O_PATH, source);
+  struct stat st;
+  if (file.ok() && (::fstat(file->get(), &st) != 0 || !S_ISREG(st.st_mode) || st.st_nlink != 1)) {
+    file = Error(EPERM, source + " is not a regular file with one link");
+  }
+  if (!file.ok()) {
+    LogRefusal(source, file.error());
+    return false;
+  }
+  if (!to.ok() || !MoveItemAt(from->get(), name, to->get(), name, source, target).ok()) {
     VTRLog("Couldn't move %@ to %@", source, target);
     return false;
   }
-  if (!GiveToMobile(target).ok()) {
+  // The moved file, as it stands now in mobile's folder: whatever mobile may
+  // have put there meanwhile is given to it only if it is a file of its own
+  // kind (one link, no link to follow).
+  Result<UniqueFd> moved = OpenEntryNoFollow(to->get(), name, O_PATH, target);
+  if (!moved.ok() || !GiveToAccount(moved->get(), paths_.mobileAccount, target).ok()) {
     VTRLog("Couldn't change ownership for %@", target);
     return false;
   }
   return true;
 }
 
-bool VTRHOperations::prepareDirectory(const std::string& path, bool writableByMobile) {
-  if (!FileExists(path) && !CreateDirectory(path, true).ok()) return false;
+Result<UniqueFd> VTRHOperations::prepareDirectoryAt(const std::string& path, bool writableByMobile) {
+  std::optional<CheckedPath> checked = checkClientPath(path, ClientUse::kChange);
+  if (!checked) return Error(EPERM, path);
+  Result<UniqueFd> dir = resolver_.openDirectory(*checked, /*create=*/true);
+  if (!dir.ok()) {
+    // A directory that cannot be made fails without a word; a link or a
+    // file standing in the way is a refusal.
+    const int code = dir.error().code();
+    if (code == ELOOP || code == ENOTDIR) LogRefusal(path, dir.error());
+    return dir.error();
+  }
   if (writableByMobile) {
     // These two messages pass the path where the method name stands and have
     // no argument for their last conversion; their texts are kept as they are.
-    Result<Value> attributes = AttributesOfItem(path);
-    if (!attributes.ok()) {
+    struct stat st;
+    if (::fstat(dir->get(), &st) != 0) {
       VTRLog("%s: Cannot get attribute from %@", path, nullptr);
-      return false;
+      return Error::FromErrno(path);
     }
-    const uint64_t permissions = attributes->get(kNSFilePosixPermissions).unsignedInteger().value_or(0);
-    const auto opened = static_cast<uint16_t>(permissions | 0077);
-    Status set = SetAttributes(Dictionary({{kNSFilePosixPermissions, Value::Unsigned(opened)}}), path);
-    if (!set.ok()) {
-      VTRLog("%s: Cannot set attribute for %@ - %@", path, set.error().description(), nullptr);
-      return false;
+    if (::fchmod(dir->get(), (st.st_mode & 07777) | 0077) != 0) {
+      const Error error = Error::FromErrno(path);
+      VTRLog("%s: Cannot set attribute for %@ - %@", path, error.description(), nullptr);
+      return error;
     }
   }
-  const std::string staging = AppendPathComponent(path, kStagingFolderName);
-  if (FileExists(staging)) {
-    Status removed = RemoveItem(staging);
+  const std::string& staging = paths_.stagingFolderName;
+  if (EntryExists(dir->get(), staging)) {
+    const std::string stagingPath = AppendPathComponent(checked->path, staging);
+    Status removed = RemoveItemAt(dir->get(), staging, stagingPath);
     if (!removed.ok()) {
-      VTRLog("%s: Could not remove the path %@ with error - %@(0x%x)", kPrepareDirectoryMethod, staging,
+      VTRLog("%s: Could not remove the path %@ with error - %@(0x%x)", kPrepareDirectoryMethod, stagingPath,
              removed.error().description(), static_cast<unsigned>(removed.error().code()));
-      return false;
+      return removed.error();
     }
   }
-  return true;
+  return dir;
+}
+
+bool VTRHOperations::prepareDirectory(const std::string& path, bool writableByMobile) {
+  return prepareDirectoryAt(path, writableByMobile).ok();
 }
 
 bool VTRHOperations::prepareLogContainer(const std::string& path) {
-  if (!prepareDirectory(path, true)) return false;
-  if (Result<std::vector<std::string>> names = ContentsOfDirectory(path); names.ok()) {
+  Result<UniqueFd> dir = prepareDirectoryAt(path, true);
+  if (!dir.ok()) return false;
+  // Each entry is handled relative to the folder listed, by descriptor: an
+  // entry swapped for a link after the listing is opened as the link itself
+  // and passed over.
+  if (Result<std::vector<std::string>> names = DirectoryEntryNames(dir->get(), path); names.ok()) {
     for (const std::string& name : *names) {
-      if (HasPrefix(name, kLogFilePrefix)) (void)GiveToMobile(AppendPathComponent(path, name));
+      if (!HasPrefix(name, paths_.logEntryPrefix)) continue;
+      const std::string entryPath = AppendPathComponent(path, name);
+      Result<UniqueFd> entry = OpenEntryNoFollow(dir->get(), name, O_PATH, entryPath);
+      if (entry.ok()) (void)GiveToAccount(entry->get(), paths_.mobileAccount, entryPath);
     }
   }
   return true;
 }
 
 bool VTRHOperations::removeDirectory(const std::string& path) {
-  if (!FileExists(path)) return true;
-  return RemoveItem(path).ok();
+  std::optional<CheckedPath> checked = checkClientPath(path, ClientUse::kChange);
+  if (!checked) return false;
+  Result<UniqueFd> parent = resolver_.openParent(*checked);
+  if (!parent.ok()) {
+    const int code = parent.error().code();
+    if (code == ENOENT || code == ENOTDIR) return true;  // nothing there to remove
+    LogRefusal(path, parent.error());
+    return false;
+  }
+  if (!EntryExists(parent->get(), checked->name())) return true;
+  return RemoveItemAt(parent->get(), checked->name(), checked->path).ok();
 }
 
 }  // namespace vtr

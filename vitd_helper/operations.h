@@ -2,25 +2,46 @@
 // for, done as root. Whatever must afterwards be usable without privilege is
 // handed to the account "mobile" (owner and group by name).
 //
+// Every path a client sends goes through the client-path resolver
+// (client_path_resolver.h) and every step after it acts on the descriptors
+// opened there; the helper's own fixed paths (helper_paths.h) are opened the
+// same way, without the area rules. A refused path is one log line ("Refused
+// path ...") and false.
+//
 // Every method runs synchronously on the caller's thread, returns true on
 // success, and reports a failure by false plus at most one log line; nothing
-// is retried or rolled back. The object has no state; the helper calls it one
-// command at a time.
+// is retried or rolled back. The helper calls it one command at a time.
 #ifndef VTR_VITD_HELPER_OPERATIONS_H_
 #define VTR_VITD_HELPER_OPERATIONS_H_
 
+#include <memory>
 #include <string>
+
+#include "platform/result.h"
+#include "platform/unique_fd.h"
+#include "vitd_helper/client_path_resolver.h"
+#include "vitd_helper/helper_paths.h"
 
 namespace vtr {
 
 class VTRHOperations {
  public:
+  // The process's operations: default paths, the default client areas, the
+  // root directory "/" (the sandbox root once the helper has chrooted).
+  // Created on first use; the daemon sets its areas before serving.
   static VTRHOperations& sharedInstance();
 
-  // Moves "/var/root/Library/Preferences/com.orvane.Vitrell.plist" to
-  // "/var/mobile/Library/Preferences/" and gives it to mobile. False, with no
-  // message, when there is nothing to move or the target exists already
-  // (never overwritten).
+  VTRHOperations(HelperPaths paths, ClientPathResolver resolver);
+
+  // Replaces the client areas (the daemon loads them at start).
+  void setClientAreas(ClientAreas areas);
+  const ClientPathResolver& resolver() const { return resolver_; }
+  const HelperPaths& paths() const { return paths_; }
+
+  // Moves the preferences file from root's preferences folder to mobile's
+  // and gives it to mobile. False, with no message, when there is nothing to
+  // move or the target exists already (never overwritten). A file with more
+  // than one link is never handed over.
   bool migratePreferencesFile();
 
   // Makes sure the directory path exists (created with its parents when
@@ -30,29 +51,40 @@ class VTRHOperations {
   bool prepareDirectory(const std::string& path, bool writableByMobile);
 
   // prepareDirectory(path, true), then hands every entry whose name begins
-  // with "vitd-" to mobile (failures there are ignored).
+  // with "vitd-" to mobile: directories, and regular files with one link;
+  // never a symbolic link or a special file (failures there are ignored).
   bool prepareLogContainer(const std::string& path);
 
   // Removes path with everything below it; true when it was not there.
   bool removeDirectory(const std::string& path);
 
-  // Records the metadata of the tree at path into the device manifest
-  // "/private/var/VTRWorkContainer/DeviceManifest.plist", a binary property
-  // list written whole or not at all. Any of "/private", "/private/",
-  // "/private/var" and "/private/var/" selects the whole device: the scan of
-  // "/private/var" keyed relative to "/private", without the application
-  // areas, reporting progress. Any other path is scanned relative to itself
-  // without its immediate hidden entries. inclusive adds the scanned
+  // Records the metadata of the tree at path into the device manifest, a
+  // binary property list written whole or not at all. Any of the whole-
+  // device spellings selects the whole device: its scan root keyed relative
+  // to the parent, without the application areas, reporting progress. Any
+  // other path is scanned relative to itself without its immediate hidden
+  // entries. Closed trees are never scanned. inclusive adds the scanned
   // directory itself. The result is the scan's; a file that cannot be
-  // written is not a failure.
+  // written is not a failure. SIGTERM ends the scan within a second (false).
   bool createDeviceManifest(const std::string& path, bool inclusive);
 
   // Makes stagingPath a hard link of source (a directory: its directories
-  // recreated, its files linked, its symbolic links recreated).
+  // recreated, its files linked, its symbolic links recreated), both in the
+  // client areas; the destination may not lie inside the source.
   bool createHardLinks(const std::string& source, const std::string& stagingPath);
 
-  // Moves the staging directory to "/var/backup", replacing what was there.
+  // Moves the staging directory (a real directory, no link) to the final
+  // location, replacing what was there.
   bool moveStagingToFinal(const std::string& stagingPath);
+
+ private:
+  // The checked client path, or nullopt after the refusal is logged.
+  std::optional<CheckedPath> checkClientPath(const std::string& path, ClientUse use) const;
+  // prepareDirectory, answering the directory opened.
+  Result<UniqueFd> prepareDirectoryAt(const std::string& path, bool writableByMobile);
+
+  HelperPaths paths_;
+  ClientPathResolver resolver_;
 };
 
 }  // namespace vtr

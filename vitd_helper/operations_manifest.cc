@@ -1,57 +1,81 @@
 // The device manifest: the metadata of a tree (or of the whole device)
 // recorded into a fixed binary property-list file.
+#include <fcntl.h>
+
 #include <algorithm>
-#include <array>
 #include <memory>
 
 #include "model/log.h"
 #include "model/manifest.h"
 #include "model/manifest_file.h"
 #include "model/progress_updater.h"
+#include "platform/file_tree.h"
+#include "platform/open_beneath.h"
+#include "platform/paths.h"
 #include "vitd_helper/operations.h"
 
 namespace vtr {
 namespace {
 
-constexpr std::array<std::string_view, 4> kWholeDeviceRoots = {"/private", "/private/", "/private/var",
-                                                                "/private/var/"};
-constexpr char kWholeDeviceScanRoot[] = "/private/var";
-constexpr char kWholeDeviceRelativeTo[] = "/private";
-const std::vector<std::string> kWholeDeviceSkipped = {
-    "/private/var/mobile/Containers",
-    "/private/var/mobile/Applications",
-    "/private/var/mobile/BuildraBuiltProducts",
-};
-constexpr char kDeviceManifestPath[] = "/private/var/VTRWorkContainer/DeviceManifest.plist";
+// The full paths (spelled from treePath) of the entries directly in dir
+// whose names begin with "."; none when dir cannot be listed.
+std::vector<std::string> HiddenEntries(int dir, const std::string& treePath) {
+  std::vector<std::string> hidden;
+  Result<std::vector<std::string>> names = DirectoryEntryNames(dir, treePath);
+  if (!names.ok()) return hidden;
+  std::sort(names->begin(), names->end());
+  for (const std::string& name : *names) {
+    if (HasPrefix(name, ".")) hidden.push_back(AppendPathComponent(treePath, name));
+  }
+  return hidden;
+}
 
 }  // namespace
 
 bool VTRHOperations::createDeviceManifest(const std::string& path, bool inclusive) {
   VTRLog("Will create device manifest...");
-  // No transaction is needed to keep SIGTERM out: the listener reads it only
-  // between requests, so the file below is always finished first.
-  VTRManifest manifest;
-  std::string scanRoot, relativeTo;
-  std::vector<std::string> skip;
   // Plain string equality: "/private//var" or "/private/var/mobile" scan as
   // ordinary trees.
-  const bool wholeDevice =
-      std::find(kWholeDeviceRoots.begin(), kWholeDeviceRoots.end(), path) != kWholeDeviceRoots.end();
+  const std::vector<std::string>& roots = paths_.wholeDeviceRoots;
+  const bool wholeDevice = std::find(roots.begin(), roots.end(), path) != roots.end();
+  const std::string scanRoot = wholeDevice ? paths_.wholeDeviceScanRoot : path;
+  Result<CheckedPath> checked = wholeDevice ? ClientPathResolver::CheckFixed(scanRoot)
+                                            : resolver_.check(scanRoot, ClientUse::kScan);
+  Result<UniqueFd> parent = checked.ok() ? resolver_.openParent(*checked) : Result<UniqueFd>(checked.error());
+  if (!parent.ok()) {
+    LogRefusal(path, parent.error());
+    return false;
+  }
+  const TreeLocation location{std::make_shared<const UniqueFd>(std::move(*parent)), checked->name()};
+
+  VTRManifest manifest;
+  manifest.setTreeLocation(location);
+  std::string relativeTo;
+  std::vector<std::string> skip;
   if (wholeDevice) {
-    scanRoot = kWholeDeviceScanRoot;
-    relativeTo = kWholeDeviceRelativeTo;
-    skip = kWholeDeviceSkipped;
+    relativeTo = paths_.wholeDeviceRelativeTo;
+    skip = paths_.wholeDeviceSkipped;
     manifest.setProgressUpdater(&VTRProgressUpdater::sharedInstance());
   } else {
-    scanRoot = path;
     relativeTo = path;
-    skip = VTRManifest::immediateHiddenFilesUnderPath(path);
+    if (Result<UniqueFd> tree = OpenEntryNoFollow(location.parent->get(), location.name, O_RDONLY | O_DIRECTORY, path);
+        tree.ok()) {
+      skip = HiddenEntries(tree->get(), path);
+    }
   }
+  // What the client may not read is never recorded.
+  for (std::string& closed : resolver_.closedTreesWithin(*checked, scanRoot)) skip.push_back(std::move(closed));
 
   // The records stream into the file as the scan makes them. When the file
   // cannot be made (its directory is missing) the scan still runs and
   // answers; only the file is missing, as it would be had the write failed.
-  Result<std::unique_ptr<ManifestFileWriter>> output = ManifestFileWriter::Create(kDeviceManifestPath);
+  // Its folder is opened without following links: it may be the client's.
+  Result<std::unique_ptr<ManifestFileWriter>> output = Error(ENOENT, paths_.deviceManifest);
+  if (Result<CheckedPath> file = ClientPathResolver::CheckFixed(paths_.deviceManifest); file.ok()) {
+    if (Result<UniqueFd> folder = resolver_.openParent(*file); folder.ok()) {
+      output = ManifestFileWriter::CreateIn(std::move(*folder), file->path);
+    }
+  }
   if (output.ok()) skip.push_back((*output)->temporaryPath());
   const VTRManifest::Handler discard = [](const VTRFileMetadata&, const std::string&) { return true; };
   const bool scanned = manifest.enumerateAndCollectMetaData(scanRoot, relativeTo, skip, inclusive,

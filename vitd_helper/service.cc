@@ -6,13 +6,9 @@
 
 #include "model/log.h"
 #include "vitd_helper/message_responder.h"
-#include "xpc/listener.h"
 
 namespace vtr {
 namespace {
-
-// The process-wide listener: made once, never released while the process lives.
-Listener* gListener = nullptr;
 
 // A connection delivers only dictionaries (anything else is a protocol error
 // that closes it), so this cannot fail; it stands guard all the same.
@@ -25,6 +21,8 @@ void AssertDictionary(const XpcObject& event) {
 }
 
 void HandleConnectionEvent(const std::shared_ptr<Connection>& connection, const ConnectionEvent& event) {
+  // Whatever a peer makes the helper log counts against that peer's budget.
+  ScopedLogPeer peer(connection->peer().uid());
   VTRDebugLog("Checking the type");
   if (event.kind == ConnectionEvent::Kind::kInvalid) {
     VTRDebugLog("It's an XPC_TYPE_ERROR");
@@ -33,16 +31,57 @@ void HandleConnectionEvent(const std::shared_ptr<Connection>& connection, const 
     return;
   }
   VTRLog("Received an XPC request?");
-  AssertDictionary(event.message);
+  // A dropped frame came from a peer without the entitlement: it was never
+  // decoded, and the responder's check says why it gets no reply.
+  if (event.kind == ConnectionEvent::Kind::kMessage) AssertDictionary(event.message);
   VTRLog("VTRH: Received a XPC request");
   VTRHMessageResponder::sharedInstance().setConnection(connection);
   VTRHMessageResponder::sharedInstance().handleXPCMessage(event.message);
   VTRLog("Message handled");
 }
 
-void HandleListenerEvent(const ListenerEvent& event) {
+// Whether a peer's frames are worth decoding: its executable holds the
+// entitlement now. The responder checks again for every message.
+bool TrustPeer(const PeerIdentity& peer) {
+  Result<SecTask> task = SecTask::CreateWithPeer(peer);
+  return task.ok() && VTRHMessageResponder::GrantsEntitlement(task->copyValueForEntitlement(kVitrelldEntitlement));
+}
+
+}  // namespace
+
+HelperService::HelperService(UniqueFd procDirectory, std::string socketPath)
+    : proc_(std::make_shared<const UniqueFd>(std::move(procDirectory))), socketPath_(std::move(socketPath)) {}
+
+int HelperService::createXPCListener() {
+  if (listener_) return 0;
+  ListenerOptions options;
+  options.procDirectory = proc_;
+  options.trustPeer = TrustPeer;
+  Result<std::unique_ptr<Listener>> listener = Listener::Create(socketPath_, options);
+  if (!listener.ok()) {
+    VTRLog("Could not create XPC listener.");
+    return 1;
+  }
+  listener_ = std::move(*listener);
+  listener_->setEventHandler([this](const ListenerEvent& event) { handleListenerEvent(event); });
+  return 0;
+}
+
+int HelperService::run() {
+  if (createXPCListener() != 0) return 1;
+  listener_->run();
+  return exitStatus_;
+}
+
+void HelperService::finish(int status) {
+  exitStatus_ = status;
+  listener_->stop();
+}
+
+void HelperService::handleListenerEvent(const ListenerEvent& event) {
   switch (event.kind) {
     case ListenerEvent::Kind::kConnection: {
+      ScopedLogPeer peer(event.connection->peer().uid());
       VTRLog("It's an XPC_TYPE_CONNECTION");
       VTRLog("Start to deal with new connection");
       // The handler holds its connection; the connection drops its handler
@@ -54,36 +93,15 @@ void HandleListenerEvent(const ListenerEvent& event) {
     }
     case ListenerEvent::Kind::kTerminationImminent:
       VTRLog("XPC connection will be closed");
-      std::exit(0);
+      return finish(0);
     case ListenerEvent::Kind::kConnectionInvalid:
       VTRLog("No XPC connection, exiting");
-      std::exit(0);
+      return finish(0);
     case ListenerEvent::Kind::kError:
       VTRLog("Got XPC error on listener connection: %s", event.description);
-      gListener->cancel();
-      std::exit(1);
+      listener_->cancel();
+      return finish(1);
   }
-}
-
-}  // namespace
-
-int CreateXPCListener(UniqueFd procDirectory) {
-  if (gListener != nullptr) return 0;
-  ListenerOptions options;
-  options.procDirectory = std::make_shared<UniqueFd>(std::move(procDirectory));
-  Result<std::unique_ptr<Listener>> listener = Listener::Create(kServiceSocketPath, options);
-  if (!listener.ok()) {
-    VTRLog("Could not create XPC listener.");
-    std::exit(1);
-  }
-  gListener = listener->release();
-  gListener->setEventHandler(HandleListenerEvent);
-  return 0;
-}
-
-void RunService() {
-  gListener->run();
-  std::exit(0);  // run() returns only when stopped, which the helper never does
 }
 
 }  // namespace vtr

@@ -6,14 +6,14 @@
 #include <utility>
 
 #include "xpc/listener.h"
-#include "xpc/socket_io.h"
 #include "xpc/wire_codec.h"
 
 namespace vtr {
 
-Connection::Connection(Listener* owner, uint64_t token, UniqueFd socket, PeerIdentity peer,
+Connection::Connection(Listener* owner, uint64_t token, UniqueFd socket, PeerIdentity peer, bool trusted,
                        std::chrono::milliseconds sendTimeout)
-    : owner_(owner), token_(token), socket_(std::move(socket)), peer_(std::move(peer)), sendTimeout_(sendTimeout) {}
+    : owner_(owner), token_(token), socket_(std::move(socket)), peer_(std::move(peer)), trusted_(trusted),
+      sendTimeout_(sendTimeout), assembler_(trusted) {}
 
 Connection::~Connection() = default;
 
@@ -23,9 +23,49 @@ Status Connection::send(const XpcObject& message) {
   if (!valid()) return Error(ENOTCONN, "the connection is closed");
   Result<XpcBytes> frame = EncodeFrame(message);
   if (!frame) return frame.error();
-  Status sent = SendAll(socket_.get(), *frame, sendTimeout_);
-  if (!sent) close("send failed: " + sent.error().description());
-  return sent;
+  if (outgoing_.size() - outgoingSent_ + frame->size() > kMaxQueuedBytes) {
+    close("dropped: it stopped reading (its unread output passed the limit)");
+    return Error(ETIMEDOUT, "the peer stopped reading");
+  }
+  if (outgoingSent_ == outgoing_.size()) lastProgress_ = Clock::now();
+  outgoing_.insert(outgoing_.end(), frame->begin(), frame->end());
+  flush();
+  if (!valid()) return Error(ENOTCONN, invalidReason_);
+  if (std::optional<Clock::time_point> deadline = sendDeadline(); deadline && Clock::now() > *deadline) {
+    close("dropped: it stopped reading");
+    return Error(ETIMEDOUT, "the peer stopped reading");
+  }
+  return Status::Ok();
+}
+
+void Connection::flush() {
+  const bool waiting = outgoingSent_ < outgoing_.size();
+  while (outgoingSent_ < outgoing_.size() && valid()) {
+    const ssize_t n = ::send(socket_.get(), outgoing_.data() + outgoingSent_, outgoing_.size() - outgoingSent_,
+                             MSG_NOSIGNAL | MSG_DONTWAIT);
+    if (n > 0) {
+      outgoingSent_ += static_cast<size_t>(n);
+      lastProgress_ = Clock::now();
+      continue;
+    }
+    if (n < 0 && errno == EINTR) continue;
+    if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) break;
+    close("send failed: " + Error::FromErrno("send").description());
+    return;
+  }
+  if (outgoingSent_ == outgoing_.size()) {
+    outgoing_.clear();
+    outgoingSent_ = 0;
+  }
+  const bool waitingNow = outgoingSent_ < outgoing_.size();
+  if (owner_ && valid() && waiting != waitingNow) owner_->wantWrite(*this, waitingNow);
+}
+
+void Connection::writeReady() { flush(); }
+
+std::optional<Connection::Clock::time_point> Connection::sendDeadline() const {
+  if (outgoingSent_ == outgoing_.size()) return std::nullopt;
+  return lastProgress_ + sendTimeout_;
 }
 
 void Connection::cancel() {
@@ -58,18 +98,27 @@ void Connection::readReady(std::span<uint8_t> scratch) {
       reportBuffered();
       continue;
     }
+    const uint64_t cost = assembler_.decodeCost();
     XpcBytes body = assembler_.takeFrame();
     reportBuffered();
-    Result<XpcObject> message = DecodeMessage(body);
-    body = XpcBytes();
-    if (!message) {
-      close("protocol error: " + message.error().message());
-      return;
+    ConnectionEvent event{ConnectionEvent::Kind::kDroppedMessage, XpcObject(), {}};
+    if (trusted_) {
+      if (cost > MaxDecodeCost(static_cast<uint32_t>(body.size()))) {
+        close("protocol error: a message whose objects would take more than four times its size");
+        return;
+      }
+      Result<XpcObject> message = DecodeMessage(body);
+      body = XpcBytes();
+      if (!message) {
+        close("protocol error: " + message.error().message());
+        return;
+      }
+      event = ConnectionEvent{ConnectionEvent::Kind::kMessage, std::move(*message), {}};
     }
     if (handler_) {
       // A copy: the handler may replace itself while it runs.
       EventHandler handler = handler_;
-      handler(ConnectionEvent{ConnectionEvent::Kind::kMessage, std::move(*message), {}});
+      handler(event);
     }
   }
 }
@@ -79,7 +128,9 @@ void Connection::close(std::string reason) {
   invalidReason_ = std::move(reason);
   if (owner_) owner_->retire(shared_from_this());
   socket_.reset();
-  assembler_ = FrameAssembler();
+  assembler_ = FrameAssembler(trusted_);
+  outgoing_ = XpcBytes();
+  outgoingSent_ = 0;
   reportBuffered();
 }
 

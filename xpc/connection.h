@@ -19,12 +19,14 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <optional>
 #include <span>
 #include <string>
 
 #include "platform/result.h"
 #include "platform/unique_fd.h"
 #include "xpc/frame_assembler.h"
+#include "xpc/message_peer.h"
 #include "xpc/peer_identity.h"
 #include "xpc/xpc_object.h"
 
@@ -33,20 +35,21 @@ namespace vtr {
 class Listener;
 
 struct ConnectionEvent {
-  enum class Kind { kMessage, kInvalid };
+  // kDroppedMessage: a valid frame from an untrusted peer, not decoded.
+  enum class Kind { kMessage, kDroppedMessage, kInvalid };
   Kind kind;
-  // kMessage: the dictionary received.
+  // kMessage: the dictionary received (null for kDroppedMessage).
   XpcObject message;
   // kInvalid: why the connection ended, e.g. "closed by the peer" or
   // "protocol error: unknown tag 0x0b at offset 5".
   std::string reason;
 };
 
-class Connection : public std::enable_shared_from_this<Connection> {
+class Connection : public MessagePeer, public std::enable_shared_from_this<Connection> {
  public:
   using EventHandler = std::function<void(const ConnectionEvent&)>;
 
-  ~Connection();
+  ~Connection() override;
   Connection(const Connection&) = delete;
   Connection& operator=(const Connection&) = delete;
 
@@ -55,12 +58,19 @@ class Connection : public std::enable_shared_from_this<Connection> {
   // set are dropped.
   void setEventHandler(EventHandler handler);
 
-  // Writes message (a dictionary) as one frame, waiting at most the send
-  // timeout for the peer to make room. An Error when the message cannot be
-  // encoded (the connection stays), and when the connection is closed or the
-  // write fails or times out; in the latter cases the connection is closed
-  // and its invalid event follows once the current handler has returned.
-  Status send(const XpcObject& message);
+  // Output a peer may leave unread before it is dropped.
+  static constexpr size_t kMaxQueuedBytes = size_t{1} << 20;
+
+  // Writes message (a dictionary) as one frame: what the socket takes now,
+  // the rest queued (see above). An Error when the message cannot be encoded
+  // (the connection stays), and when the connection is closed, the write
+  // fails, or the peer has stopped reading; in the latter cases the
+  // connection is closed and its invalid event follows once the current
+  // handler has returned.
+  Status send(const XpcObject& message) override;
+
+  // SecTask::CreateWithPeer of the peer.
+  Result<SecTask> copyTask() const override { return SecTask::CreateWithPeer(peer_); }
 
   // Closes the connection; its invalid event ("cancelled") follows once the
   // current handler has returned. Harmless when already closed.
@@ -71,11 +81,16 @@ class Connection : public std::enable_shared_from_this<Connection> {
 
   // The peer as captured at accept.
   const PeerIdentity& peer() const { return peer_; }
+  // Whether the listener trusted the peer at accept (its frames are decoded).
+  bool trusted() const { return trusted_; }
 
  private:
   friend class Listener;
 
-  Connection(Listener* owner, uint64_t token, UniqueFd socket, PeerIdentity peer, std::chrono::milliseconds sendTimeout);
+  using Clock = std::chrono::steady_clock;
+
+  Connection(Listener* owner, uint64_t token, UniqueFd socket, PeerIdentity peer, bool trusted,
+             std::chrono::milliseconds sendTimeout);
 
   // Reads what the socket has (one read into scratch) and delivers the
   // messages completed by it; closes on end of stream or protocol error.
@@ -86,6 +101,12 @@ class Connection : public std::enable_shared_from_this<Connection> {
   void deliverInvalid();
   // Closes without any event (the listener is going away).
   void detach();
+  // Writes what the queue holds, as far as the socket takes it now.
+  void flush();
+  // The socket can take more: flush, and stop asking once the queue is empty.
+  void writeReady();
+  // When a stalled queue must have moved, or nullopt when nothing waits.
+  std::optional<Clock::time_point> sendDeadline() const;
   // Tells the owner how the bytes held for the frame in progress changed.
   void reportBuffered();
   size_t bufferedBytes() const { return assembler_.bufferedBytes(); }
@@ -94,8 +115,12 @@ class Connection : public std::enable_shared_from_this<Connection> {
   uint64_t token_;
   UniqueFd socket_;
   PeerIdentity peer_;
+  bool trusted_;
   std::chrono::milliseconds sendTimeout_;
   FrameAssembler assembler_;
+  XpcBytes outgoing_;
+  size_t outgoingSent_ = 0;  // bytes at the front of outgoing_ already written
+  Clock::time_point lastProgress_;
   size_t reportedBuffered_ = 0;
   EventHandler handler_;
   std::string invalidReason_;

@@ -17,9 +17,15 @@ Result<size_t> FrameAssembler::consume(std::span<const uint8_t> input) {
     if (!length) return length.error();
     length_ = *length;
     haveLength_ = true;
+    validator_.start(length_);
   }
-  size_t n = std::min(input.size() - used, size_t{length_} - body_.size());
-  body_.insert(body_.end(), input.begin() + used, input.begin() + used + n);
+  const size_t n = std::min(input.size() - used, size_t{length_} - validator_.received());
+  const std::span<const uint8_t> body = input.subspan(used, n);
+  if (Status valid = validator_.feed(body); !valid.ok()) return valid.error();
+  if (validator_.received() == length_) {
+    if (Status whole = validator_.finish(); !whole.ok()) return whole.error();
+  }
+  if (keepBodies_) body_.insert(body_.end(), body.begin(), body.end());
   return used + n;
 }
 
@@ -29,6 +35,7 @@ XpcBytes FrameAssembler::takeFrame() {
   headerFill_ = 0;
   haveLength_ = false;
   length_ = 0;
+  validator_.start(0);
   return body;
 }
 

@@ -20,9 +20,11 @@
 #include <cstring>
 #include <optional>
 #include <string_view>
+#include <vector>
 #include <utility>
 
 #include "platform/format.h"
+#include "platform/termination.h"
 
 namespace vtr {
 namespace {
@@ -31,6 +33,7 @@ constexpr uint64_t kListeningToken = 0;
 constexpr uint64_t kSignalToken = 1;
 constexpr uint64_t kTimerToken = 2;
 constexpr uint64_t kWakeupToken = 3;
+constexpr uint64_t kHousekeepingToken = 4;
 constexpr uint64_t kFirstConnectionToken = 16;
 constexpr int kMaxEventsPerWait = 64;
 // Bounds the accepts per wake-up so that a flood of connections cannot keep
@@ -103,6 +106,7 @@ Listener::Listener(UniqueFd listening, ListenerOptions options)
     : options_(std::move(options)), listening_(std::move(listening)), nextToken_(kFirstConnectionToken) {}
 
 Listener::~Listener() {
+  if (signals_) UnwatchTerminationSignal(signals_.get());
   for (auto& [token, connection] : connections_) connection->detach();
   for (auto& connection : retired_) connection->detach();
 }
@@ -183,9 +187,14 @@ Status Listener::setUp() {
   if (!acceptTimer_) return Error::FromErrno("timerfd_create");
   wakeup_.reset(::eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC));
   if (!wakeup_) return Error::FromErrno("eventfd");
+  housekeepingTimer_.reset(::timerfd_create(CLOCK_MONOTONIC, TFD_NONBLOCK | TFD_CLOEXEC));
+  if (!housekeepingTimer_) return Error::FromErrno("timerfd_create");
+  // Long work polls the same signalfd, so that SIGTERM ends it too.
+  WatchTerminationSignal(signals_.get());
 
   for (auto [fd, token] : {std::pair{listening_.get(), kListeningToken}, std::pair{signals_.get(), kSignalToken},
-                           std::pair{acceptTimer_.get(), kTimerToken}, std::pair{wakeup_.get(), kWakeupToken}}) {
+                           std::pair{acceptTimer_.get(), kTimerToken}, std::pair{wakeup_.get(), kWakeupToken},
+                           std::pair{housekeepingTimer_.get(), kHousekeepingToken}}) {
     if (Status added = EpollControl(epoll_.get(), EPOLL_CTL_ADD, fd, EPOLLIN, token); !added) return added;
   }
   return Status::Ok();
@@ -207,6 +216,13 @@ void Listener::run() {
     for (int i = 0; i < n && running_; ++i) {
       dispatch(events[i].data.u64, events[i].events);
       deliverPendingEvents();
+      // A request that ran long may have read SIGTERM itself (and stopped
+      // early for it): the loop learns of it here.
+      if (TerminationRequested() && !terminationDelivered_) {
+        terminationDelivered_ = true;
+        deliver(ListenerEvent{ListenerEvent::Kind::kTerminationImminent, nullptr, {}});
+        deliverPendingEvents();
+      }
     }
   }
 }
@@ -238,13 +254,18 @@ void Listener::dispatch(uint64_t token, uint32_t events) {
     case kWakeupToken:
       if (::read(wakeup_.get(), &count, sizeof count) == sizeof count) running_ = false;
       return;
+    case kHousekeepingToken:
+      if (::read(housekeepingTimer_.get(), &count, sizeof count) == sizeof count) housekeeping();
+      return;
     default:
       break;
   }
   auto found = connections_.find(token);
   if (found == connections_.end()) return;  // closed earlier in this batch
   std::shared_ptr<Connection> connection = found->second;
-  connection->readReady(scratch_);
+  if (events & EPOLLOUT) connection->writeReady();
+  if ((events & ~static_cast<uint32_t>(EPOLLOUT)) != 0 && connection->valid()) connection->readReady(scratch_);
+  if (connection->sendDeadline()) armHousekeeping();
 }
 
 void Listener::acceptReady() {
@@ -274,19 +295,27 @@ bool Listener::acceptOne() {
         return false;
     }
   }
-  // Over the cap, or without credentials: closed as it goes out of scope.
+  // Over a cap, or without credentials: closed as it goes out of scope.
   if (connections_.size() >= options_.maxConnections) return true;
   Result<PeerIdentity> peer = PeerIdentity::Capture(socket.get(), proc_->get());
   if (!peer) return true;
+  size_t& ofUid = connectionsPerUid_[peer->uid()];
+  if (ofUid >= options_.maxConnectionsPerUid) return true;
+  const bool trusted = !options_.trustPeer || options_.trustPeer(*peer);
   int fd = socket.get();
   uint64_t token = nextToken_++;
   std::shared_ptr<Connection> connection(
-      new Connection(this, token, std::move(socket), std::move(*peer), options_.sendTimeout));
+      new Connection(this, token, std::move(socket), std::move(*peer), trusted, options_.sendTimeout));
   if (!EpollControl(epoll_.get(), EPOLL_CTL_ADD, fd, EPOLLIN | EPOLLRDHUP, token)) {
     connection->detach();
     return true;
   }
+  ++ofUid;
   connections_.emplace(token, connection);
+  if (!trusted) {
+    untrustedDeadlines_.emplace_back(std::chrono::steady_clock::now() + options_.untrustedLifetime, token);
+    if (untrustedDeadlines_.size() == 1) armHousekeeping();
+  }
   deliver(ListenerEvent{ListenerEvent::Kind::kConnection, connection, {}});
   return true;
 }
@@ -314,7 +343,11 @@ void Listener::stopListening(ListenerEvent::Kind kind, std::string description) 
 void Listener::readSignal() {
   struct signalfd_siginfo info;
   while (::read(signals_.get(), &info, sizeof info) == sizeof info) {
-    if (info.ssi_signo == SIGTERM) deliver(ListenerEvent{ListenerEvent::Kind::kTerminationImminent, nullptr, {}});
+    if (info.ssi_signo == SIGTERM && !terminationDelivered_) {
+      RequestTermination();
+      terminationDelivered_ = true;
+      deliver(ListenerEvent{ListenerEvent::Kind::kTerminationImminent, nullptr, {}});
+    }
   }
 }
 
@@ -340,8 +373,54 @@ void Listener::deliverPendingEvents() {
 
 void Listener::retire(const std::shared_ptr<Connection>& connection) {
   ::epoll_ctl(epoll_.get(), EPOLL_CTL_DEL, connection->socket_.get(), nullptr);
-  connections_.erase(connection->token_);
+  if (connections_.erase(connection->token_) > 0) {
+    auto count = connectionsPerUid_.find(connection->peer().uid());
+    if (count != connectionsPerUid_.end() && --count->second == 0) connectionsPerUid_.erase(count);
+  }
   retired_.push_back(connection);
+}
+
+void Listener::wantWrite(const Connection& connection, bool want) {
+  const uint32_t events = EPOLLIN | EPOLLRDHUP | (want ? static_cast<uint32_t>(EPOLLOUT) : 0u);
+  (void)EpollControl(epoll_.get(), EPOLL_CTL_MOD, connection.socket_.get(), events, connection.token_);
+  if (want) armHousekeeping();
+}
+
+void Listener::housekeeping() {
+  const auto now = std::chrono::steady_clock::now();
+  while (!untrustedDeadlines_.empty() && untrustedDeadlines_.front().first <= now) {
+    const uint64_t token = untrustedDeadlines_.front().second;
+    untrustedDeadlines_.pop_front();
+    if (auto found = connections_.find(token); found != connections_.end()) {
+      found->second->close("closed: a peer without the entitlement may stay only a short while");
+    }
+  }
+  std::vector<std::shared_ptr<Connection>> stalled;
+  for (const auto& [token, connection] : connections_) {
+    if (std::optional<std::chrono::steady_clock::time_point> due = connection->sendDeadline(); due && *due <= now) {
+      stalled.push_back(connection);
+    }
+  }
+  for (const std::shared_ptr<Connection>& connection : stalled) connection->close("dropped: it stopped reading");
+  armHousekeeping();
+}
+
+void Listener::armHousekeeping() {
+  std::optional<std::chrono::steady_clock::time_point> next;
+  if (!untrustedDeadlines_.empty()) next = untrustedDeadlines_.front().first;
+  for (const auto& [token, connection] : connections_) {
+    if (std::optional<std::chrono::steady_clock::time_point> due = connection->sendDeadline(); due) {
+      next = next ? std::min(*next, *due) : *due;
+    }
+  }
+  struct itimerspec spec = {};
+  if (next) {
+    const auto wait = std::max<std::chrono::nanoseconds>(*next - std::chrono::steady_clock::now(),
+                                                         std::chrono::milliseconds(1));
+    spec.it_value.tv_sec = static_cast<time_t>(wait.count() / 1'000'000'000);
+    spec.it_value.tv_nsec = static_cast<long>(wait.count() % 1'000'000'000);
+  }
+  ::timerfd_settime(housekeepingTimer_.get(), 0, &spec, nullptr);
 }
 
 void Listener::bufferedChanged(size_t before, size_t after) {

@@ -9,14 +9,18 @@
 //
 // Reads never block: each connection assembles its frames as bytes arrive,
 // so a client that sends half a frame and stalls, a slow client or hundreds
-// of idle ones never delay another client's request. Limits:
-// - at most maxConnections connections; beyond them a new connection is
-//   accepted and closed at once (so it does not sit in the backlog);
+// of idle ones never delay another client's request. Nor do writes (see
+// connection.h). Limits:
+// - at most maxConnections connections, and maxConnectionsPerUid for one
+//   user; beyond them a new connection is accepted and closed at once (so it
+//   does not sit in the backlog);
+// - a peer that trustPeer does not trust has its frames validated and
+//   dropped, never stored or decoded, and its connection closed
+//   untrustedLifetime after accept;
 // - the bytes held for frames in progress, over all connections, stay under
 //   partialFrameBudget: past it the connection holding the largest partial
 //   frame is dropped (a request of ordinary size then still gets through);
-// - a write waits at most sendTimeout for a client to make room; a client
-//   that stops reading is dropped.
+// - a client whose output makes no progress for sendTimeout is dropped.
 //
 // Listener events: a new connection; termination imminent (SIGTERM, read
 // through a signalfd: since requests run inside handlers, a SIGTERM that
@@ -63,7 +67,12 @@ struct ListenerEvent {
 
 struct ListenerOptions {
   size_t maxConnections = 1024;
+  size_t maxConnectionsPerUid = 32;
   std::chrono::milliseconds sendTimeout{5000};
+  // Whether a peer's frames are decoded, asked once at accept; null trusts
+  // every peer.
+  std::function<bool(const PeerIdentity&)> trustPeer;
+  std::chrono::milliseconds untrustedLifetime{10000};
   size_t partialFrameBudget = size_t{64} << 20;
   std::chrono::milliseconds acceptRetryPause{100};
   // An open /proc directory through which the peers' processes are looked
@@ -110,7 +119,6 @@ class Listener {
   // current handler has returned. Accepted connections stay.
   void cancel();
 
-  size_t connectionCount() const { return connections_.size(); }
 
  private:
   friend class Connection;
@@ -127,12 +135,17 @@ class Listener {
   void resumeAccepting();
   void stopListening(ListenerEvent::Kind kind, std::string description);
   void readSignal();
+  // Closes what is past its time: untrusted connections, stalled senders;
+  // then arms the timer for the next such moment.
+  void housekeeping();
+  void armHousekeeping();
   void deliver(const ListenerEvent& event);
   void deliverPendingEvents();
 
   // Called by connections.
   void retire(const std::shared_ptr<Connection>& connection);
   void bufferedChanged(size_t before, size_t after);
+  void wantWrite(const Connection& connection, bool want);
 
   ListenerOptions options_;
   UniqueFd listening_;
@@ -140,11 +153,16 @@ class Listener {
   UniqueFd epoll_;
   UniqueFd signals_;
   UniqueFd acceptTimer_;
+  UniqueFd housekeepingTimer_;
+  bool terminationDelivered_ = false;
   UniqueFd wakeup_;
   EventHandler handler_;
   bool running_ = false;
   uint64_t nextToken_;
   std::unordered_map<uint64_t, std::shared_ptr<Connection>> connections_;
+  std::unordered_map<uid_t, size_t> connectionsPerUid_;
+  // Untrusted connections by the time they must be gone, oldest first.
+  std::deque<std::pair<std::chrono::steady_clock::time_point, uint64_t>> untrustedDeadlines_;
   std::deque<std::shared_ptr<Connection>> retired_;
   std::deque<ListenerEvent> pendingListenerEvents_;
   size_t bufferedBytes_ = 0;

@@ -50,6 +50,12 @@ Result<SecTask> SecTask::CreateWithPeer(const PeerIdentity& peer) {
   return task;
 }
 
+SecTask SecTask::WithEntitlements(Value entitlements) {
+  SecTask task;
+  task.entitlements_ = std::move(entitlements);
+  return task;
+}
+
 Value SecTask::copyValueForEntitlement(std::string_view name) const { return entitlements_.get(name); }
 
 }  // namespace vtr

@@ -49,6 +49,9 @@ class SecTask {
   // may not vouch for itself or whose section is unreadable gives a task
   // without entitlements, not an Error.
   static Result<SecTask> CreateWithPeer(const PeerIdentity& peer);
+  // A task holding the given entitlements dictionary, for tests of the
+  // command core that have no peer process.
+  static SecTask WithEntitlements(Value entitlements);
 
   // The value of the named entitlement; nil when there is none (no such
   // key, no section, untrusted or unreadable executable).

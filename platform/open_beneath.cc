@@ -1,0 +1,73 @@
+#include "platform/open_beneath.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+
+namespace vtr {
+
+Result<std::vector<std::string>> SplitPathComponents(std::string_view path) {
+  if (path.empty()) return Error(EINVAL, "an empty path");
+  if (path.find('\0') != std::string_view::npos) return Error(EINVAL, "a NUL byte in the path");
+  if (path.front() != '/') return Error(EINVAL, "not an absolute path");
+  std::vector<std::string> components;
+  size_t start = 0;
+  while (start < path.size()) {
+    size_t end = path.find('/', start);
+    if (end == std::string_view::npos) end = path.size();
+    const std::string_view component = path.substr(start, end - start);
+    if (component == "..") return Error(EINVAL, "a \"..\" component");
+    if (!component.empty() && component != ".") components.emplace_back(component);
+    start = end + 1;
+  }
+  return components;
+}
+
+std::string JoinPathComponents(const std::vector<std::string>& components, size_t count) {
+  if (count == 0) return "/";
+  std::string path;
+  for (size_t i = 0; i < count && i < components.size(); ++i) path += "/" + components[i];
+  return path;
+}
+
+Result<UniqueFd> OpenDirectoryBeneath(int rootFd, const std::vector<std::string>& components, size_t count,
+                                      bool create, mode_t mode) {
+  constexpr int kFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
+  UniqueFd current(::openat(rootFd, ".", kFlags));
+  if (!current) return Error::FromErrno("/");
+  for (size_t i = 0; i < count; ++i) {
+    const char* name = components[i].c_str();
+    UniqueFd next(::openat(current.get(), name, kFlags));
+    if (!next && errno == ENOENT && create) {
+      if (::mkdirat(current.get(), name, mode) != 0 && errno != EEXIST) {
+        return Error::FromErrno(JoinPathComponents(components, i + 1));
+      }
+      next.reset(::openat(current.get(), name, kFlags));
+    }
+    if (!next) {
+      const int error = errno;
+      const std::string reached = JoinPathComponents(components, i + 1);
+      struct stat st;
+      if ((error == ELOOP || error == ENOTDIR) && ::fstatat(current.get(), name, &st, AT_SYMLINK_NOFOLLOW) == 0 &&
+          S_ISLNK(st.st_mode)) {
+        return Error(ELOOP, "a symbolic link stands at " + reached);
+      }
+      return Error(error, reached);
+    }
+    current = std::move(next);
+  }
+  return current;
+}
+
+Result<UniqueFd> OpenEntryNoFollow(int dirFd, const std::string& name, int flags, const std::string& pathForErrors) {
+  UniqueFd fd(::openat(dirFd, name.c_str(), flags | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+  if (fd) return fd;
+  const int error = errno;
+  struct stat st;
+  if ((error == ELOOP || error == ENOTDIR) && ::fstatat(dirFd, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0 &&
+      S_ISLNK(st.st_mode)) {
+    return Error(ELOOP, "a symbolic link stands at " + pathForErrors);
+  }
+  return Error(error, pathForErrors);
+}
+
+}  // namespace vtr

@@ -1,0 +1,20 @@
+// Reading an open file to its end, bounded: the one way the helper reads
+// small files whole (accounts, its areas file).
+#ifndef VTR_PLATFORM_READ_FULLY_H_
+#define VTR_PLATFORM_READ_FULLY_H_
+
+#include <cstddef>
+#include <string>
+
+#include "platform/result.h"
+
+namespace vtr {
+
+// Everything fd holds from its current offset to its end. An Error (EFBIG)
+// as soon as more than limit bytes arrive (the file may grow while it is
+// read), or the read's errno; retries EINTR. fd stays the caller's.
+Result<std::string> ReadFully(int fd, size_t limit);
+
+}  // namespace vtr
+
+#endif  // VTR_PLATFORM_READ_FULLY_H_
