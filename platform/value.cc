@@ -1,6 +1,7 @@
 #include "platform/value.h"
 
 #include <algorithm>
+#include <cctype>
 #include <cmath>
 
 namespace vtr {
@@ -161,6 +162,18 @@ Value Value::get(std::string_view key) const {
 bool Value::boolValue() const {
   if (auto b = boolean()) return *b;
   if (auto d = real()) return *d != 0;
+  if (const std::string* text = string()) {
+    // A string's boolean value as the platform reads it: leading white space
+    // skipped, then an optional sign and zeros; YES when Y, y, T, t or a
+    // digit 1-9 follows, whatever comes after it.
+    size_t i = 0;
+    while (i < text->size() && std::isspace(static_cast<unsigned char>((*text)[i]))) ++i;
+    if (i < text->size() && ((*text)[i] == '+' || (*text)[i] == '-')) ++i;
+    while (i < text->size() && (*text)[i] == '0') ++i;
+    if (i == text->size()) return false;
+    const char c = (*text)[i];
+    return c == 'Y' || c == 'y' || c == 'T' || c == 't' || (c >= '1' && c <= '9');
+  }
   return false;
 }
 

@@ -69,8 +69,10 @@ class Value {
   // For a dictionary, the value under key; nil when absent or not a dictionary.
   Value get(std::string_view key) const;
 
-  // True for a true boolean and a non-zero number, false otherwise: what a
-  // number's boolean value is (nil and other types read as false).
+  // True for a true boolean, a non-zero number, and a string whose first
+  // character after white space, a sign and zeros is Y, y, T, t or 1-9 (as
+  // the platform reads "YES", "true", "1"); false otherwise (nil and other
+  // types read as false).
   bool boolValue() const;
 
   // The text "%@" prints: strings bare, numbers and booleans as numbers (1/0),

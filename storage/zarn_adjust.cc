@@ -82,14 +82,28 @@ int zarnAdjustPartition(const ZarnMediaProperties* props, uint8_t* gptHeader, ui
     entry.setEnd(entry.begin() + blocks - 1);
   }
 
+  // An entry that ends before it starts has no length to keep: re-packed,
+  // its length would wrap around and the layout seem to fit.
+  for (uint32_t i = 0; i < newCount; ++i) {
+    if (EntryAt(gptEntries, i).end() < EntryAt(gptEntries, i).begin()) {
+      std::fprintf(stderr, "zarn: partition %u ends before it starts\n", i);
+      return -1;
+    }
+  }
   uint64_t next = firstUsable;
+  bool wrapped = false;
   const std::array<uint32_t, kGptTableEntries> order = OrderByStart(gptEntries, newCount);
   for (uint32_t i = 0; i < newCount; ++i) {
     ZarnEntryEditor e = EntryAt(gptEntries, order[i]);
     const uint64_t length = e.end() - e.begin();
     e.setBegin(next);
-    e.setEnd(next + length);
-    next = next + length + 1;
+    uint64_t end = 0;
+    wrapped = wrapped || __builtin_add_overflow(next, length, &end) || __builtin_add_overflow(end, 1, &next);
+    e.setEnd(end);
+  }
+  if (wrapped) {
+    std::fprintf(stderr, "zarn: new layout does not fit, overflows by 0x%llx blocks\n", ~0ULL);
+    return -1;
   }
   if (next > lastUsable + 1) {
     std::fprintf(stderr, "zarn: new layout does not fit, overflows by 0x%llx blocks\n",

@@ -32,7 +32,7 @@ void MessageValidator::start(uint32_t bodyLength) {
   length_ = bodyLength;
 }
 
-Status MessageValidator::fail(const char* rule) const {
+Status MessageValidator::fail(const std::string& rule) const {
   return Error::Invalid(Format("%s at offset %u", rule, offset_));
 }
 
@@ -69,7 +69,7 @@ Status MessageValidator::step(uint8_t byte) {
     case State::kTag:
       return beginObject(byte);
     case State::kBool:
-      if (byte > 1) return fail("a bool byte other than 0 or 1");
+      if (byte > 1) return fail(Format("bool byte 0x%02x", byte));
       objectDone();
       return Status::Ok();
     case State::kLength:
@@ -117,7 +117,7 @@ Status MessageValidator::beginObject(uint8_t tag) {
     case XpcObject::Type::kDictionary:
       break;
     default:
-      return fail("an unknown tag");
+      return fail(Format("unknown tag 0x%02x", tag));
   }
   const auto type = static_cast<XpcObject::Type>(tag);
   lengthOf_ = type == XpcObject::Type::kData     ? LengthOf::kData
@@ -155,7 +155,7 @@ Status MessageValidator::beginLength(uint32_t length) {
       if (uint64_t{length} * (dictionary ? kMinEntryBytes : kMinObjectBytes) > rest) {
         return fail("a count larger than the bytes left");
       }
-      if (depth_ == kMaxMessageDepth) return fail("nesting deeper than the limit");
+      if (depth_ == kMaxMessageDepth) return fail(Format("nesting deeper than %d", kMaxMessageDepth));
       cost_ += kBlockCost;
       levels_[static_cast<size_t>(depth_++)] = Level{length, dictionary};
       if (length == 0) {

@@ -20,6 +20,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <span>
+#include <string>
 
 #include "platform/result.h"
 #include "xpc/wire_codec.h"
@@ -50,7 +51,7 @@ class MessageValidator {
     bool dictionary;
   };
 
-  Status fail(const char* rule) const;
+  Status fail(const std::string& rule) const;
   // The byte at the current offset, in state_.
   Status step(uint8_t byte);
   Status beginObject(uint8_t tag);

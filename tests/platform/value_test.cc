@@ -74,7 +74,13 @@ TEST(ValueTest, TypedAccessAnswersOnlyForItsType) {
   EXPECT_EQ(Value::Integer(-1).unsignedInteger(), std::nullopt);
   EXPECT_EQ(Value::Boolean(true).integer(), std::nullopt);
   EXPECT_TRUE(Value::Integer(2).boolValue());
-  EXPECT_FALSE(Value::String("YES").boolValue());
+  // Strings read as the platform reads them.
+  for (const char* yes : {"YES", "yes", "true", "T", "1", "  9", "+1", "-0001", "Yawn", "12abc"}) {
+    EXPECT_TRUE(Value::String(yes).boolValue()) << yes;
+  }
+  for (const char* no : {"", "NO", "false", "0", "  ", "-", "000", "abc", "x1", "\n0"}) {
+    EXPECT_FALSE(Value::String(no).boolValue()) << no;
+  }
   EXPECT_FALSE(Value().boolValue());
 }
 

@@ -126,6 +126,18 @@ TEST_F(ZarnAdjustTest, RefusalsAndOverflow) {
   StoreU32(&header_[kGptEntryCountOffset], 9);
   EXPECT_EQ(Adjust(1, 4096, &messages_), -1);
   EXPECT_EQ(messages_, "zarn: cannot adjust partition 1 - out of range\n");
+
+  // An entry that ends before it starts has no length: it would wrap around
+  // and seem to fit. So would one whose length wraps the LBA range.
+  for (const Layout& broken : {Layout{{34, 133}, {300, 200}}, Layout{{34, 133}, {134, UINT64_MAX}}}) {
+    SetPartitions(broken);
+    EXPECT_EQ(Adjust(0, 4096, &messages_), -1);
+    EXPECT_NE(messages_, "") << "silently accepted";
+    EXPECT_EQ(count(), 2u);
+  }
+  SetPartitions({{34, 133}, {300, 200}});
+  EXPECT_EQ(Adjust(0, 4096, &messages_), -1);
+  EXPECT_EQ(messages_, "zarn: partition 1 ends before it starts\n");
 }
 
 }  // namespace

@@ -7,7 +7,6 @@
 #include "tests/support/file_inspection.h"
 #include "tests/support/test_support.h"
 #include "tests/vitd_helper/helper_sandbox.h"
-#include "vitd_helper/operations.h"
 
 namespace vtr::testing {
 namespace {
@@ -148,15 +147,5 @@ TEST_F(ContainersTest, PreferencesMoveOnlyWhenThereIsSomethingToMove) {
 }
 
 // The operation itself, without the helper: with the flag off the mode stays.
-TEST(OperationsTest, PrepareDirectoryWithoutTheFlagKeepsTheMode) {
-  TempDir dir;
-  const std::string path = dir / "d";
-  ASSERT_EQ(::mkdir(path.c_str(), 0700), 0);
-  ASSERT_EQ(::mkdir((path + "/VTR_staging").c_str(), 0700), 0);
-  EXPECT_TRUE(VTRHOperations::sharedInstance().prepareDirectory(path, false));
-  EXPECT_EQ(Lstat(path).st_mode & 07777, 0700u);
-  EXPECT_FALSE(Exists(path + "/VTR_staging"));
-}
-
 }  // namespace
 }  // namespace vtr::testing

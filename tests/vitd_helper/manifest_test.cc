@@ -84,11 +84,12 @@ TEST_F(ManifestTest, WholeDeviceScanIsRelativeToPrivateSkipsTheApplicationAreasA
   EXPECT_TRUE(sandbox_.logged("/private/var/mobile/Library/pipe is special file. Leave it along"));
 
   // The helper's own log changes while it scans, and the manifest did not
-  // exist yet: neither is compared.
+  // exist yet: neither is compared. Root's home is closed to clients: never
+  // recorded.
   const std::string report = check("/private/var", "/private",
                                    {"--skip /private/var/mobile/Containers", "--skip /private/var/mobile/Applications",
                                     "--skip /private/var/mobile/BuildraBuiltProducts", "--skip " + std::string(kManifest),
-                                    "--ignore /private/var/logs"});
+                                    "--skip /private/var/root", "--ignore /private/var/logs"});
   EXPECT_NE(report.find(" 0 differences"), std::string::npos) << report;
 
   Result<Value> manifest = ReadPropertyListFile(sandbox_.host(kManifest));
@@ -99,6 +100,7 @@ TEST_F(ManifestTest, WholeDeviceScanIsRelativeToPrivateSkipsTheApplicationAreasA
   EXPECT_TRUE(manifest->get("/var/mobile/Containers").isNil());
   EXPECT_TRUE(manifest->get("/var/mobile/Library/pipe").isNil());
   EXPECT_TRUE(manifest->get("/var").isNil());  // not inclusive
+  EXPECT_TRUE(manifest->get("/var/root").isNil());
 }
 
 TEST_F(ManifestTest, SubtreeIsRelativeToItselfAndSkipsOnlyItsImmediateHiddenEntries) {

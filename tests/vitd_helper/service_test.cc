@@ -151,7 +151,7 @@ TEST_F(ServiceTest, ValuesOfOtherTypesAreLeftOut) {
   };
   for (const auto& [kind, value] : skipped) {
     std::vector<XpcObject> replies =
-        sandbox_.request(Request({{"prepareWorkContainer:", value}, {"removeWorkContainer:", XpcObject::String("/x")}}),
+        sandbox_.request(Request({{"prepareWorkContainer:", value}, {"removeWorkContainer:", XpcObject::String("/private/var/x")}}),
                          2, 300ms);
     // Only the entry that survived the conversion is answered.
     EXPECT_EQ(replies, std::vector<XpcObject>{Response(true)}) << kind;
