@@ -138,15 +138,14 @@ bool VTRLogModel::openDayFile(int folder, const std::string& name, const std::st
   UniqueFd fd(::openat(folder, name.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC, 0644));
   struct stat st;
   FILE* fp = nullptr;
-  if (fd && ::fstat(fd.get(), &st) == 0) {
-    if (S_ISREG(st.st_mode) && st.st_uid == ::geteuid() && st.st_nlink == 1) {
-      fp = ::fdopen(fd.get(), "a");
-      if (fp != nullptr) fd.release();
-    } else {
-      systemLogOnly(Format("The log file %s is not a regular file of this user with one link; "
-                           "logging to the system log only",
-                           path));
-    }
+  if (fd && ::fstat(fd.get(), &st) == 0 && S_ISREG(st.st_mode) && st.st_uid == ::geteuid() && st.st_nlink == 1) {
+    fp = ::fdopen(fd.get(), "a");
+    if (fp != nullptr) fd.release();
+  } else if (fd || errno == ELOOP) {
+    // Someone else's file, a link, a fifo: never written through.
+    systemLogOnly(Format("The log file %s is not a regular file of this user with one link; "
+                         "logging to the system log only",
+                         path));
   }
   std::lock_guard<std::mutex> lock(mutex_);
   logFP_ = fp;

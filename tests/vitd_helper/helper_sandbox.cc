@@ -6,7 +6,9 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cstdio>
 #include <cstdlib>
+#include <ctime>
 #include <sstream>
 #include <thread>
 
@@ -57,6 +59,8 @@ HelperSandbox::~HelperSandbox() {
 bool HelperSandbox::start() {
   const std::string helper = HelperExecutable();
   const std::string root = root_;
+  // A socket left by an earlier helper would look like this one's.
+  ::unlink(socketPath().c_str());
   const int logFd = ::open(logPath_.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
   pid_ = ::fork();
   if (pid_ == 0) {
@@ -162,6 +166,16 @@ int HelperSandbox::terminate() {
 }
 
 std::string HelperSandbox::log() const { return ReadFile(logPath_); }
+
+std::string HelperSandbox::dayLogPath() const {
+  const time_t now = ::time(nullptr);
+  struct tm local;
+  ::localtime_r(&now, &local);
+  char name[64];
+  std::snprintf(name, sizeof name, "/private/var/logs/vitd/vitd_helper-%4d%02d%02d.log", local.tm_year + 1900,
+                local.tm_mon + 1, local.tm_mday);
+  return host(name);
+}
 
 bool HelperSandbox::logged(const std::string& line) const {
   std::stringstream lines(log());

@@ -58,6 +58,10 @@ class HelperSandbox {
   // Waits up to timeout for the helper to exit by itself; its status or -1.
   int waitForExit(std::chrono::milliseconds timeout);
   bool running();
+  // The helper's process id while it runs.
+  pid_t pid() const { return pid_; }
+  // The host path of today's log file (named by the local date).
+  std::string dayLogPath() const;
 
   // Everything the helper logged so far (its standard error).
   std::string log() const;

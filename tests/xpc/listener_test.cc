@@ -196,6 +196,55 @@ TEST(ListenerTest, AClientThatStopsReadingIsDropped) {
   ExpectServed(server.path());
 }
 
+TEST(ListenerTest, ClientsThatStopReadingDelayNobodyAndAreDroppedOnTime) {
+  ListenerOptions options;
+  options.sendTimeout = std::chrono::milliseconds(2000);
+  TestServer server(options, [&](TestServer&, const std::shared_ptr<Connection>& connection, const XpcObject& message) {
+    if (!message.find("flood")) {
+      (void)connection->send(Reply());
+      return;
+    }
+    // More than the socket holds, less than the queue's limit.
+    XpcObject part = XpcObject::Dictionary({{"Data", XpcObject::Data(XpcBytes(32 << 10))}});
+    for (int i = 0; i < 20; ++i) EXPECT_TRUE(connection->send(part).ok());
+  });
+  std::vector<XpcClient> stalled;
+  for (int i = 0; i < 10; ++i) {
+    Result<XpcClient> client = XpcClient::Connect(server.path());
+    ASSERT_TRUE(client.ok());
+    ASSERT_TRUE(client->send(Ping("flood")).ok());  // and never reads
+    stalled.push_back(std::move(*client));
+  }
+  ASSERT_TRUE(server.waitUntil([](TestServer& s) { return s.messages == 10; }));
+  const auto asked = std::chrono::steady_clock::now();
+  ExpectServed(server.path());
+  EXPECT_LT(std::chrono::steady_clock::now() - asked, std::chrono::milliseconds(1000));
+  // Each is dropped once its output has not moved for the send timeout.
+  ASSERT_TRUE(server.waitUntil([](TestServer& s) { return s.invalidReasons.size() == 10; }));
+  EXPECT_GE(std::chrono::steady_clock::now() - asked, std::chrono::milliseconds(1500));
+  EXPECT_TRUE(AnyReasonContains(server, "stopped reading"));
+}
+
+TEST(ListenerTest, ConnectionsOfOneUserAreCappedAndUntrustedOnesExpire) {
+  ListenerOptions options;
+  options.maxConnectionsPerUid = 3;
+  options.untrustedLifetime = std::chrono::milliseconds(300);
+  options.trustPeer = [](const PeerIdentity&) { return false; };
+  TestServer server(options);
+  std::vector<UniqueFd> held;
+  for (int i = 0; i < 5; ++i) held.push_back(ConnectRaw(server.path()));
+  // An untrusted peer's frames are dropped, never answered.
+  SendRaw(held[0].get(), *EncodeFrame(Ping()));
+  EXPECT_TRUE(ClosedByPeer(held[3].get()));
+  EXPECT_TRUE(ClosedByPeer(held[4].get()));
+  EXPECT_TRUE(server.waitUntil([](TestServer& s) { return s.connections == 3 && s.messages == 1; }));
+  const auto start = std::chrono::steady_clock::now();
+  EXPECT_TRUE(ClosedByPeer(held[0].get())) << "an untrusted connection lives a short while only";
+  EXPECT_GE(std::chrono::steady_clock::now() - start, std::chrono::milliseconds(100));
+  char byte;
+  EXPECT_EQ(::recv(held[0].get(), &byte, 1, MSG_DONTWAIT), 0) << "and was sent nothing";
+}
+
 TEST(ListenerTest, CancelledListenerReportsInvalidAndKeepsItsConnections) {
   TestServer server(ListenerOptions{}, [](TestServer& s, const std::shared_ptr<Connection>& connection,
                                           const XpcObject&) {
