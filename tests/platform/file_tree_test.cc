@@ -16,6 +16,7 @@
 namespace vtr {
 namespace {
 
+using testing::Exists;
 using testing::Lstat;
 using testing::ReadFile;
 using testing::RemoveTree;
@@ -23,14 +24,13 @@ using testing::TempDir;
 using testing::WriteFile;
 using testing::Xattr;
 
-bool Exists(const std::string& path) {
-  struct stat st;
-  return ::lstat(path.c_str(), &st) == 0;
-}
-
 std::string LinkTarget(const std::string& path) {
   Result<std::string> target = DestinationOfSymbolicLink(path);
-  return target.ok() ? *target : "<" + target.error().description() + ">";
+  if (target.ok()) return *target;
+  std::string failed = "<";
+  failed += target.error().description();
+  failed += '>';
+  return failed;
 }
 
 // A directory on another file system than TempDir's (tmpfs at /dev/shm), or

@@ -10,6 +10,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/format.h"
 #include "platform/output_stream.h"
 #include "platform/plist.h"
 #include "tests/platform/strict_value.h"
@@ -127,7 +128,7 @@ TEST(BinaryPlistWriterTest, RoundTripKeepsEveryValueAndItsKind) {
   DictionaryBuilder wideDict;
   for (int i = 0; i < 40; ++i) {
     wideArray.push_back(Value::Integer(i - 20));
-    wideDict.add("k" + std::to_string(i), Value::Real(i / 4.0));
+    wideDict.add(Format("k%d", i), Value::Real(i / 4.0));
   }
   const Value values[] = {
       Value::Integer(-1),
@@ -181,7 +182,7 @@ TEST(BinaryPlistWriterTest, RepeatedObjectsAreWrittenOnceAndStillReadCorrectly) 
     records.push_back(Value::DictionaryOf({
         {"NSFileOwnerAccountName", Value::String("mobile")},
         {"number", Value::Integer(i % 3000)},
-        {"text", Value::String("v" + std::to_string(i % 2500))},
+        {"text", Value::String(Format("v%d", i % 2500))},
     }));
   }
   const Value value = Value::ArrayOf(records);

@@ -36,7 +36,9 @@ class ZarnAdjustTest : public ::testing::Test {
       e.setIdentity({static_cast<uint8_t>(i + 1)});
       e.setBegin(ranges[i].first);
       e.setEnd(ranges[i].second);
-      e.setAsciiName("P" + std::to_string(i));
+      std::string name = "P";
+      name += std::to_string(i);
+      e.setAsciiName(name);
     }
   }
   ZarnEntryEditor entry(size_t i) {

@@ -4,6 +4,8 @@
 #include "vitd_helper/operations.h"
 
 #include <fcntl.h>
+#include <linux/fs.h>
+#include <sys/ioctl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -132,6 +134,27 @@ TEST_F(OperationsTest, PrepareDirectoryCreatesOpensAndEmptiesOnlyWhatItWasGiven)
   EXPECT_FALSE(ops_.prepareDirectory("/private/var/mobile/file", true));
   EXPECT_TRUE(refused(log));
   EXPECT_EQ(Lstat(host("/private/var/mobile/file")).st_mode & 07777, 0600u);
+}
+
+TEST_F(OperationsTest, AStagingFolderThatCannotGoSaysWhy) {
+  if (!IsRoot()) GTEST_SKIP() << "an immutable file: needs root";
+  const std::string staging = host("/private/var/mobile/d/VTR_staging");
+  ASSERT_EQ(::mkdir(host("/private/var/mobile/d").c_str(), 0755), 0);
+  ASSERT_EQ(::mkdir(staging.c_str(), 0755), 0);
+  WriteFile(staging + "/pinned", "x");
+  UniqueFd pinned(::open((staging + "/pinned").c_str(), O_RDONLY | O_CLOEXEC));
+  int flags = 0;
+  if (::ioctl(pinned.get(), FS_IOC_GETFLAGS, &flags) != 0) GTEST_SKIP() << "no file flags here";
+  flags |= FS_IMMUTABLE_FL;
+  ASSERT_EQ(::ioctl(pinned.get(), FS_IOC_SETFLAGS, &flags), 0);
+  LogCapture log;
+  EXPECT_FALSE(ops_.prepareDirectory("/private/var/mobile/d", false));
+  flags &= ~FS_IMMUTABLE_FL;
+  ASSERT_EQ(::ioctl(pinned.get(), FS_IOC_SETFLAGS, &flags), 0);
+  EXPECT_EQ(log.messages(), std::vector<std::string>{
+                                "-[VTRHOperations prepareDirectory:writableByMobile:]: Could not remove the path "
+                                "/private/var/mobile/d/VTR_staging with error - /private/var/mobile/d/VTR_staging/pinned: "
+                                "Operation not permitted(0x1)"});
 }
 
 TEST_F(OperationsTest, LogContainerHandsOverOnlyFilesWithOneLinkAndDirectories) {

@@ -123,6 +123,30 @@ TEST_F(SecurityTest, TheHelpersOwnLogCannotBeTurnedAgainstIt) {
   EXPECT_EQ(Lstat(sandbox_.host("/private/var/logs/vitd")).st_mode & 07777, 0755u);
 }
 
+TEST_F(SecurityTest, TheDayFileIsNamedByTheLocalDateInsideTheRootToo) {
+  // Fourteen hours east of UTC or twelve west: one of them is another day
+  // than UTC right now. The zone is a file the sandbox root does not hold.
+  const time_t now = ::time(nullptr);
+  struct tm utc;
+  ::gmtime_r(&now, &utc);
+  const char* zone = utc.tm_hour < 10 ? "Etc/GMT-14" : "Etc/GMT+12";
+  const std::string file = std::string("/usr/share/zoneinfo/") + zone;
+  if (::access(file.c_str(), R_OK) != 0) GTEST_SKIP() << file << " is missing";
+  const char* previous = std::getenv("TZ");
+  const std::string saved = previous ? previous : "";
+  ::setenv("TZ", (":" + file).c_str(), 1);
+  ::tzset();
+  Start();
+  const std::string expected = sandbox_.dayLogPath();  // the test's own local date, in that zone
+  if (previous) {
+    ::setenv("TZ", saved.c_str(), 1);
+  } else {
+    ::unsetenv("TZ");
+  }
+  ::tzset();
+  EXPECT_TRUE(Exists(expected)) << expected << "\n" << sandbox_.log();
+}
+
 TEST_F(SecurityTest, OneCallIsOneLineWhateverTheClientSends) {
   Start();
   const std::string forged = "/private/var/x\n2026-01-01 00:00:00 +0000 forged line\t\x1b[31m";
