@@ -4,6 +4,21 @@
 #include <sys/stat.h>
 
 namespace vtr {
+namespace {
+
+// The error of an open of name in dirFd that failed with error: ELOOP saying
+// so where a link stands there (O_NOFOLLOW gives ELOOP or, with
+// O_DIRECTORY, ENOTDIR for one), else error naming path.
+Error OpenError(int error, int dirFd, const char* name, const std::string& path) {
+  struct stat st;
+  if ((error == ELOOP || error == ENOTDIR) && ::fstatat(dirFd, name, &st, AT_SYMLINK_NOFOLLOW) == 0 &&
+      S_ISLNK(st.st_mode)) {
+    return Error(ELOOP, "a symbolic link stands at " + path);
+  }
+  return Error(error, path);
+}
+
+}  // namespace
 
 Result<std::vector<std::string>> SplitPathComponents(std::string_view path) {
   if (path.empty()) return Error(EINVAL, "an empty path");
@@ -43,16 +58,7 @@ Result<UniqueFd> OpenDirectoryBeneath(int rootFd, const std::vector<std::string>
       }
       next.reset(::openat(current.get(), name, kFlags));
     }
-    if (!next) {
-      const int error = errno;
-      const std::string reached = JoinPathComponents(components, i + 1);
-      struct stat st;
-      if ((error == ELOOP || error == ENOTDIR) && ::fstatat(current.get(), name, &st, AT_SYMLINK_NOFOLLOW) == 0 &&
-          S_ISLNK(st.st_mode)) {
-        return Error(ELOOP, "a symbolic link stands at " + reached);
-      }
-      return Error(error, reached);
-    }
+    if (!next) return OpenError(errno, current.get(), name, JoinPathComponents(components, i + 1));
     current = std::move(next);
   }
   return current;
@@ -61,13 +67,7 @@ Result<UniqueFd> OpenDirectoryBeneath(int rootFd, const std::vector<std::string>
 Result<UniqueFd> OpenEntryNoFollow(int dirFd, const std::string& name, int flags, const std::string& pathForErrors) {
   UniqueFd fd(::openat(dirFd, name.c_str(), flags | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
   if (fd) return fd;
-  const int error = errno;
-  struct stat st;
-  if ((error == ELOOP || error == ENOTDIR) && ::fstatat(dirFd, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0 &&
-      S_ISLNK(st.st_mode)) {
-    return Error(ELOOP, "a symbolic link stands at " + pathForErrors);
-  }
-  return Error(error, pathForErrors);
+  return OpenError(errno, dirFd, name.c_str(), pathForErrors);
 }
 
 }  // namespace vtr

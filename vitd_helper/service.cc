@@ -3,6 +3,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <memory>
+#include <optional>
 
 #include "model/log.h"
 #include "vitd_helper/message_responder.h"
@@ -20,9 +21,15 @@ void AssertDictionary(const XpcObject& event) {
   std::abort();
 }
 
+// Whom the lines logged for a connection are charged to: a peer without the
+// entitlement, by its uid; the entitled client's lines are not limited.
+std::optional<uint32_t> LogPeerOf(const Connection& connection) {
+  if (connection.trusted()) return std::nullopt;
+  return connection.peer().uid();
+}
+
 void HandleConnectionEvent(const std::shared_ptr<Connection>& connection, const ConnectionEvent& event) {
-  // Whatever a peer makes the helper log counts against that peer's budget.
-  ScopedLogPeer peer(connection->peer().uid());
+  ScopedLogPeer peer(LogPeerOf(*connection));
   VTRDebugLog("Checking the type");
   if (event.kind == ConnectionEvent::Kind::kInvalid) {
     VTRDebugLog("It's an XPC_TYPE_ERROR");
@@ -81,7 +88,7 @@ void HelperService::finish(int status) {
 void HelperService::handleListenerEvent(const ListenerEvent& event) {
   switch (event.kind) {
     case ListenerEvent::Kind::kConnection: {
-      ScopedLogPeer peer(event.connection->peer().uid());
+      ScopedLogPeer peer(LogPeerOf(*event.connection));
       VTRLog("It's an XPC_TYPE_CONNECTION");
       VTRLog("Start to deal with new connection");
       // The handler holds its connection; the connection drops its handler

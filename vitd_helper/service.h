@@ -10,7 +10,8 @@
 //
 // A peer whose executable lacks the entitlement is not trusted: its frames
 // are validated and dropped undecoded (the responder still logs why it gets
-// no reply), and the lines it causes are rate-limited per uid.
+// no reply), and the lines it causes are rate-limited per uid; the entitled
+// client's are not.
 //
 // Everything runs on the thread that calls run(), inside the listener's loop.
 #ifndef VTR_VITD_HELPER_SERVICE_H_
