@@ -296,12 +296,17 @@ bool Listener::acceptOne() {
     }
   }
   // Over a cap, or without credentials: closed as it goes out of scope.
+  // Peers without the trust are counted apart from trusted ones, and may
+  // not take the last slots: however many connections they open (as root
+  // too), the entitled client still gets in.
   if (connections_.size() >= options_.maxConnections) return true;
   Result<PeerIdentity> peer = PeerIdentity::Capture(socket.get(), proc_->get());
   if (!peer) return true;
-  size_t& ofUid = connectionsPerUid_[peer->uid()];
-  if (ofUid >= options_.maxConnectionsPerUid) return true;
   const bool trusted = !options_.trustPeer || options_.trustPeer(*peer);
+  const size_t reserved = std::min(options_.maxConnectionsPerUid, options_.maxConnections / 2);
+  if (!trusted && untrustedConnections_ >= options_.maxConnections - reserved) return true;
+  size_t& ofUid = connectionsPerUid_[{peer->uid(), trusted}];
+  if (ofUid >= options_.maxConnectionsPerUid) return true;
   int fd = socket.get();
   uint64_t token = nextToken_++;
   std::shared_ptr<Connection> connection(
@@ -313,6 +318,7 @@ bool Listener::acceptOne() {
   ++ofUid;
   connections_.emplace(token, connection);
   if (!trusted) {
+    ++untrustedConnections_;
     untrustedDeadlines_.emplace_back(std::chrono::steady_clock::now() + options_.untrustedLifetime, token);
     if (untrustedDeadlines_.size() == 1) armHousekeeping();
   }
@@ -374,8 +380,9 @@ void Listener::deliverPendingEvents() {
 void Listener::retire(const std::shared_ptr<Connection>& connection) {
   ::epoll_ctl(epoll_.get(), EPOLL_CTL_DEL, connection->socket_.get(), nullptr);
   if (connections_.erase(connection->token_) > 0) {
-    auto count = connectionsPerUid_.find(connection->peer().uid());
+    auto count = connectionsPerUid_.find({connection->peer().uid(), connection->trusted()});
     if (count != connectionsPerUid_.end() && --count->second == 0) connectionsPerUid_.erase(count);
+    if (!connection->trusted()) --untrustedConnections_;
   }
   retired_.push_back(connection);
 }
@@ -395,6 +402,7 @@ void Listener::housekeeping() {
       found->second->close("closed: a peer without the entitlement may stay only a short while");
     }
   }
+
   std::vector<std::shared_ptr<Connection>> stalled;
   for (const auto& [token, connection] : connections_) {
     if (std::optional<std::chrono::steady_clock::time_point> due = connection->sendDeadline(); due && *due <= now) {

@@ -11,9 +11,10 @@
 // so a client that sends half a frame and stalls, a slow client or hundreds
 // of idle ones never delay another client's request. Nor do writes (see
 // connection.h). Limits:
-// - at most maxConnections connections, and maxConnectionsPerUid for one
-//   user; beyond them a new connection is accepted and closed at once (so it
-//   does not sit in the backlog);
+// - at most maxConnections connections, and maxConnectionsPerUid trusted and
+//   as many untrusted ones for one user; untrusted ones never take the last
+//   maxConnectionsPerUid slots (half the slots at most). Beyond that a new connection is accepted and
+//   closed at once (so it does not sit in the backlog);
 // - a peer that trustPeer does not trust has its frames validated and
 //   dropped, never stored or decoded, and its connection closed
 //   untrustedLifetime after accept;
@@ -46,6 +47,7 @@
 #include <cstdint>
 #include <deque>
 #include <functional>
+#include <map>
 #include <memory>
 #include <string>
 #include <unordered_map>
@@ -160,8 +162,11 @@ class Listener {
   bool running_ = false;
   uint64_t nextToken_;
   std::unordered_map<uint64_t, std::shared_ptr<Connection>> connections_;
-  std::unordered_map<uid_t, size_t> connectionsPerUid_;
-  // Untrusted connections by the time they must be gone, oldest first.
+  // Connections by uid and whether trusted.
+  std::map<std::pair<uid_t, bool>, size_t> connectionsPerUid_;
+  size_t untrustedConnections_ = 0;
+  // Untrusted connections by the time they must be gone, oldest first (an
+  // entry may outlive its connection).
   std::deque<std::pair<std::chrono::steady_clock::time_point, uint64_t>> untrustedDeadlines_;
   std::deque<std::shared_ptr<Connection>> retired_;
   std::deque<ListenerEvent> pendingListenerEvents_;

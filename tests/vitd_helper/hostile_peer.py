@@ -1,7 +1,8 @@
 #!/usr/bin/env python3
 """A peer without the helper's entitlement, as any local user is: it drops
-to uid/gid 65534 and attacks the helper's socket in one of these ways,
-printing what it saw as one line of "key=value" words.
+to uid/gid 65534 (unless HOSTILE_AS_ROOT is set: root without the
+entitlement) and attacks the helper's socket in one of these ways, printing
+what it saw as one line of "key=value" words.
 
   hostile_peer.py SOCKET idle N        open N connections and hold them;
                                        prints how many the helper closed at once
@@ -47,9 +48,10 @@ def ping():
 
 def main():
     path, mode, arg = sys.argv[1], sys.argv[2], (sys.argv[3] if len(sys.argv) > 3 else "0")
-    os.setgroups([])
-    os.setgid(NOBODY)
-    os.setuid(NOBODY)
+    if not os.environ.get("HOSTILE_AS_ROOT"):
+        os.setgroups([])
+        os.setgid(NOBODY)
+        os.setuid(NOBODY)
     if mode == "idle":
         held = [connect(path) for _ in range(int(arg))]
         time.sleep(1)

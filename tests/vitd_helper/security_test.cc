@@ -236,6 +236,12 @@ TEST_F(SecurityTest, PeersWithoutTheEntitlementCostLittleAndLockNobodyOut) {
   // and the entitled client (another user) is served all the while.
   EXPECT_EQ(Hostile(sandbox_, "idle", "100"), "opened=100 closed=68\n");
   EXPECT_EQ(Answer(sandbox_, "removeWorkContainer:", XpcObject::String("/private/var/absent")), true);
+  // Root without the entitlement is held to the same, and never takes the
+  // slots of the entitled client, root as well.
+  ::setenv("HOSTILE_AS_ROOT", "1", 1);
+  EXPECT_EQ(Hostile(sandbox_, "idle", "1100"), "opened=1100 closed=1068\n");
+  ::unsetenv("HOSTILE_AS_ROOT");
+  EXPECT_EQ(Answer(sandbox_, "removeWorkContainer:", XpcObject::String("/private/var/absent")), true);
 
   // 100,000 tiny frames write a bounded log, with a count of what was left out.
   const off_t logBefore = Lstat(sandbox_.dayLogPath()).st_size;

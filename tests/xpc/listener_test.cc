@@ -3,8 +3,11 @@
 #include <sys/stat.h>
 
 #include <algorithm>
+#include <atomic>
 #include <string>
 #include <vector>
+
+#include <atomic>
 
 #include <gtest/gtest.h>
 
@@ -229,7 +232,9 @@ TEST(ListenerTest, ConnectionsOfOneUserAreCappedAndUntrustedOnesExpire) {
   ListenerOptions options;
   options.maxConnectionsPerUid = 3;
   options.untrustedLifetime = std::chrono::milliseconds(300);
-  options.trustPeer = [](const PeerIdentity&) { return false; };
+  options.maxConnections = 7;  // 4 for untrusted peers, 3 kept for trusted ones
+  std::atomic<bool> trustNext{false};
+  options.trustPeer = [&trustNext](const PeerIdentity&) { return trustNext.load(); };
   TestServer server(options);
   std::vector<UniqueFd> held;
   for (int i = 0; i < 5; ++i) held.push_back(ConnectRaw(server.path()));
@@ -243,6 +248,18 @@ TEST(ListenerTest, ConnectionsOfOneUserAreCappedAndUntrustedOnesExpire) {
   EXPECT_GE(std::chrono::steady_clock::now() - start, std::chrono::milliseconds(100));
   char byte;
   EXPECT_EQ(::recv(held[0].get(), &byte, 1, MSG_DONTWAIT), 0) << "and was sent nothing";
+
+  // However many untrusted connections the same user holds, a trusted one
+  // (the entitled client, also root here) still gets in.
+  options.maxConnectionsPerUid = 8;
+  options.untrustedLifetime = std::chrono::seconds(30);
+  TestServer crowded(options);
+  std::vector<UniqueFd> crowd;
+  for (int i = 0; i < 8; ++i) crowd.push_back(ConnectRaw(crowded.path()));
+  for (int i = 4; i < 8; ++i) EXPECT_TRUE(ClosedByPeer(crowd[i].get())) << i;
+  EXPECT_TRUE(crowded.waitUntil([](TestServer& s) { return s.connections == 4; }));
+  trustNext = true;
+  ExpectServed(crowded.path());
 }
 
 TEST(ListenerTest, CancelledListenerReportsInvalidAndKeepsItsConnections) {
