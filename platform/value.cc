@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cctype>
 #include <cmath>
+#include <cstdint>
 
 namespace vtr {
 namespace {
@@ -175,6 +176,29 @@ bool Value::boolValue() const {
     return c == 'Y' || c == 'y' || c == 'T' || c == 't' || (c >= '1' && c <= '9');
   }
   return false;
+}
+
+int32_t Value::intValue() const {
+  constexpr int64_t kMin = INT32_MIN, kMax = INT32_MAX;
+  if (auto b = boolean()) return *b ? 1 : 0;
+  if (auto i = integer()) return static_cast<int32_t>(*i);
+  if (auto u = unsignedInteger()) return static_cast<int32_t>(*u);
+  if (auto d = real()) {
+    if (std::isnan(*d)) return 0;
+    return static_cast<int32_t>(std::clamp<double>(std::trunc(*d), kMin, kMax));
+  }
+  if (const std::string* text = string()) {
+    size_t i = 0;
+    while (i < text->size() && std::isspace(static_cast<unsigned char>((*text)[i]))) ++i;
+    const bool negative = i < text->size() && (*text)[i] == '-';
+    if (i < text->size() && ((*text)[i] == '+' || (*text)[i] == '-')) ++i;
+    int64_t magnitude = 0;
+    for (; i < text->size() && (*text)[i] >= '0' && (*text)[i] <= '9'; ++i) {
+      magnitude = std::min<int64_t>(magnitude * 10 + ((*text)[i] - '0'), kMax + 1);
+    }
+    return static_cast<int32_t>(std::clamp<int64_t>(negative ? -magnitude : magnitude, kMin, kMax));
+  }
+  return 0;
 }
 
 bool operator==(const Value& a, const Value& b) {

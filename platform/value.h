@@ -74,6 +74,11 @@ class Value {
   // the platform reads "YES", "true", "1"); false otherwise (nil and other
   // types read as false).
   bool boolValue() const;
+  // The value as a C int, as the platform's intValue reads it: a boolean
+  // 1 or 0, an integer truncated to 32 bits, a real toward zero (clamped),
+  // a string's leading decimal integer after white space and a sign
+  // ("2.5" is 2, "12abc" 12, clamped to the int range); anything else 0.
+  int32_t intValue() const;
 
   // The text "%@" prints: strings bare, numbers and booleans as numbers (1/0),
   // dates as "2026-11-21 09:30:00 +0000", data as <0011aabb ...>, arrays and

@@ -82,6 +82,15 @@ TEST(ValueTest, TypedAccessAnswersOnlyForItsType) {
     EXPECT_FALSE(Value::String(no).boolValue()) << no;
   }
   EXPECT_FALSE(Value().boolValue());
+  // Integer values, as versions are read.
+  const std::pair<Value, int32_t> ints[] = {
+      {Value::Integer(2), 2},       {Value::Real(2.9), 2},          {Value::Real(-2.9), -2},
+      {Value::String("2.5"), 2},    {Value::String(" +12abc"), 12}, {Value::String("-7"), -7},
+      {Value::String("x1"), 0},     {Value::String("99999999999"), INT32_MAX},
+      {Value::Boolean(true), 1},    {Value::Real(1e30), INT32_MAX}, {Value::Data({1}), 0},
+      {Value::Integer(int64_t{1} << 32 | 3), 3},
+  };
+  for (const auto& [value, expected] : ints) EXPECT_EQ(value.intValue(), expected) << value.description();
 }
 
 TEST(ValueTest, DictionariesKeepKeysSortedAndUnique) {

@@ -77,9 +77,10 @@ bool HelperSandbox::start() {
     ::_exit(127);
   }
   ::close(logFd);
+  // The socket file appears at bind, a moment before the helper listens:
+  // ready means a connection is accepted.
   for (int i = 0; i < 200; ++i) {
-    struct stat st;
-    if (::stat(socketPath().c_str(), &st) == 0 && S_ISSOCK(st.st_mode)) return true;
+    if (XpcClient::Connect(socketPath()).ok()) return true;
     if (!running()) return false;
     std::this_thread::sleep_for(std::chrono::milliseconds(20));
   }

@@ -1,0 +1,22 @@
+#include "platform/device_properties.h"
+
+#include <fcntl.h>
+#include <unistd.h>
+
+#include "platform/read_fully.h"
+#include "platform/unique_fd.h"
+
+namespace vtr {
+
+std::optional<bool> SigningFuse(const std::string& efivarsFolder) {
+  const std::string path = efivarsFolder + "/SecureBoot-8be4df61-93ca-11d2-aa0d-00e098032b8c";
+  UniqueFd fd(::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+  if (!fd) return std::nullopt;
+  Result<std::string> bytes = ReadFully(fd.get(), 64);
+  if (!bytes.ok() || bytes->size() < 5) return std::nullopt;
+  const unsigned char value = static_cast<unsigned char>((*bytes)[4]);
+  if (value > 1) return std::nullopt;
+  return value == 1;
+}
+
+}  // namespace vtr

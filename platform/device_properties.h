@@ -1,0 +1,22 @@
+// Answers the device gives about itself, as the platform's device-property
+// query would.
+#ifndef VTR_PLATFORM_DEVICE_PROPERTIES_H_
+#define VTR_PLATFORM_DEVICE_PROPERTIES_H_
+
+#include <optional>
+#include <string>
+
+namespace vtr {
+
+inline constexpr char kEfiVariablesFolder[] = "/sys/firmware/efi/efivars";
+
+// "SigningFuse": whether the device is fused for production signing. Read
+// from the UEFI Secure Boot state, the variable
+// SecureBoot-8be4df61-93ca-11d2-aa0d-00e098032b8c in efivarsFolder: 4
+// attribute bytes, then one byte, 1 fused and 0 not. No variable, one
+// shorter than 5 bytes or a value byte other than 0 and 1: no answer.
+std::optional<bool> SigningFuse(const std::string& efivarsFolder = kEfiVariablesFolder);
+
+}  // namespace vtr
+
+#endif  // VTR_PLATFORM_DEVICE_PROPERTIES_H_

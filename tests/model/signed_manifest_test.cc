@@ -1,0 +1,284 @@
+// Signed manifests against a throwaway PKI the test makes with the openssl
+// tool: a production root and a test root (SHA-1 signed, as in the format's
+// era), an intermediate, signers fit and unfit to sign, and one expired.
+#include "model/signed_manifest.h"
+
+#include <openssl/evp.h>
+#include <openssl/pem.h>
+#include <openssl/x509.h>
+#include <sys/stat.h>
+
+#include <cstdio>
+#include <cstdlib>
+#include <fstream>
+#include <memory>
+
+#include <gtest/gtest.h>
+
+#include "platform/plist.h"
+#include "tests/support/test_support.h"
+
+namespace vtr {
+namespace {
+
+using testing::LogCapture;
+using testing::ReadFile;
+using testing::TempDir;
+using testing::WriteFile;
+
+Bytes FileBytes(const std::string& path) {
+  const std::string text = ReadFile(path);
+  return Bytes(text.begin(), text.end());
+}
+
+class SignedManifestTest : public ::testing::Test {
+ protected:
+  static void SetUpTestSuite() {
+    pki_ = new TempDir();
+    const std::string d = pki_->path();
+    const std::string script = R"(set -e
+cd ")" + d + R"("
+mkdir -p production test
+printf 'basicConstraints=critical,CA:TRUE\nkeyUsage=critical,keyCertSign\n' > ca.ext
+printf 'keyUsage=critical,digitalSignature\n' > signer.ext
+printf 'keyUsage=critical,keyEncipherment\n' > unfit.ext
+root() { openssl req -x509 -newkey rsa:2048 -nodes -sha1 -days 3650 -keyout "$1.key" -out "$1.pem" -subj "/CN=$1" \
+  -addext 'basicConstraints=critical,CA:TRUE' -addext 'keyUsage=critical,keyCertSign' 2>/dev/null; }
+issue() { openssl req -newkey rsa:2048 -nodes -keyout "$1.key" -out "$1.csr" -subj "/CN=$1" 2>/dev/null
+  openssl x509 -req -sha1 -days 365 -in "$1.csr" -CA "$2.pem" -CAkey "$2.key" -CAcreateserial -out "$1.pem" \
+  -extfile "$3" 2>/dev/null
+  openssl x509 -in "$1.pem" -outform DER -out "$1.der"; }
+root production-root; root test-root
+cp production-root.pem production/; cp test-root.pem test/
+issue intermediate production-root ca.ext
+issue signer intermediate signer.ext
+issue unfit intermediate unfit.ext
+issue test-signer test-root signer.ext
+)";
+    ASSERT_EQ(std::system(("sh -c '" + Quote(script) + "'").c_str()), 0) << "the openssl tool failed";
+  }
+  static void TearDownTestSuite() { delete pki_; }
+
+  // Shell single quotes around text.
+  static std::string Quote(const std::string& text) {
+    std::string out;
+    for (char c : text) out += c == '\'' ? std::string("'\\''") : std::string(1, c);
+    return out;
+  }
+
+  void SetUp() override {
+    anchors_.production = pki_->path() + "/production";
+    anchors_.test = pki_->path() + "/test";
+    anchors_.efiVariables = efi_.path();
+  }
+
+  static std::string Pki(const std::string& name) { return pki_->path() + "/" + name; }
+
+  static Value Payload(Value version = Value::Integer(3)) {
+    const Value record = Value::DictionaryOf({{"VTRManifestFileHash", Value::Data({1, 2, 3})}});
+    return Value::DictionaryOf({
+        {"Version", version},
+        {"Info", Value::String("demo")},
+        {"Backup", Value::DictionaryOf({{"/", record}})},
+        {"App", Value::ArrayOf({})},
+        {"AppData", Value::DictionaryOf({{"com.example.app", Value::DictionaryOf({{"Manifest", Value::DictionaryOf({})}})}})},
+    });
+  }
+
+  // The signature the openssl tool makes of bytes with key.
+  static Bytes Sign(const Bytes& bytes, const std::string& key) {
+    TempDir work;
+    WriteFile(work / "payload", std::string(bytes.begin(), bytes.end()));
+    const std::string command = "openssl dgst -sha1 -sign '" + key + "' -out '" + (work / "sig") + "' '" +
+                                (work / "payload") + "'";
+    EXPECT_EQ(std::system(command.c_str()), 0);
+    return FileBytes(work / "sig");
+  }
+
+  // A signed manifest file's bytes, with every part replaceable.
+  static Bytes Signed(const Value& payload, const std::vector<std::string>& chain, const std::string& key,
+                      Value version = Value::Integer(2), bool flipPayload = false) {
+    Bytes payloadBytes = *EncodeBinaryPropertyList(payload);
+    const Bytes signature = Sign(payloadBytes, key);
+    if (flipPayload) payloadBytes[payloadBytes.size() / 2] ^= 1;
+    Array certificates;
+    for (const std::string& der : chain) certificates.push_back(Value::Data(FileBytes(der)));
+    return *EncodeBinaryPropertyList(Value::DictionaryOf({{"Version", version},
+                                                         {"Certificate", Value::ArrayOf(certificates)},
+                                                         {"Payload", Value::Data(payloadBytes)},
+                                                         {"Signature", Value::Data(signature)}}));
+  }
+  static Bytes ProductionSigned(const Value& payload) {
+    return Signed(payload, {Pki("signer.der"), Pki("intermediate.der")}, Pki("signer.key"));
+  }
+
+  // The device's Secure Boot answer: 1 fused, 0 not, -1 none.
+  void SetFuse(int value) {
+    const std::string path = efi_ / "SecureBoot-8be4df61-93ca-11d2-aa0d-00e098032b8c";
+    ::unlink(path.c_str());
+    if (value >= 0) WriteFile(path, std::string("\x06\x00\x00\x00", 4) + static_cast<char>(value));
+  }
+
+  static TempDir* pki_;
+  TempDir efi_;
+  SigningAnchors anchors_;
+};
+
+TempDir* SignedManifestTest::pki_ = nullptr;
+
+TEST_F(SignedManifestTest, AProductionSignedManifestIsReadWithItsParts) {
+  LogCapture log;
+  std::optional<VTRSignedManifest> manifest =
+      VTRSignedManifest::signedManifestWithBytes(ProductionSigned(Payload()), anchors_);
+  ASSERT_TRUE(manifest.has_value()) << ::testing::PrintToString(log.messages());
+  EXPECT_EQ(manifest->getVersion(), 3);
+  EXPECT_EQ(manifest->getInfo(), Value::String("demo"));
+  EXPECT_TRUE(manifest->getManifest().get("/").dictionary());
+  EXPECT_TRUE(manifest->getAppDataList().get("com.example.app").get("Manifest").dictionary());
+  EXPECT_TRUE(manifest->getGroupDataList().isNil());
+  EXPECT_TRUE(manifest->getPlugInDataList().isNil());
+  EXPECT_EQ(log.messages(), (std::vector<std::string>{"Verifing strong signing", "Manifest passed signature check."}));
+}
+
+TEST_F(SignedManifestTest, VersionsAndRequiredKeysAreCheckedWithTheirMessages) {
+  const std::string init = "-[VTRSignedManifest initWithNSStream:]: ";
+  const auto without = [](const char* key) {
+    Value payload = Payload();
+    DictionaryBuilder builder;
+    for (const auto& [k, v] : *payload.dictionary()) {
+      if (k != key) builder.add(k, v);
+    }
+    return builder.build();
+  };
+  const struct {
+    const char* name;
+    Bytes file;
+    const char* lastMessage;  // nullptr: accepted
+  } cases[] = {
+      {"outer version 1", Signed(Payload(), {Pki("signer.der")}, Pki("signer.key"), Value::Integer(1)),
+       "signed manifest version 1 is not supported yet"},
+      {"outer version 3", Signed(Payload(), {Pki("signer.der")}, Pki("signer.key"), Value::Integer(3)),
+       "signed manifest version 3 is not supported yet"},
+      {"outer version \"2.5\"",
+       Signed(Payload(), {Pki("signer.der"), Pki("intermediate.der")}, Pki("signer.key"), Value::String("2.5")),
+       nullptr},
+      {"payload version 2", ProductionSigned(Payload(Value::Integer(2))), "raw manifest version 2 is not supported."},
+      {"payload version 5", ProductionSigned(Payload(Value::Integer(5))), "raw manifest version 5 is not supported."},
+      {"payload version 4", ProductionSigned(Payload(Value::Integer(4))), nullptr},
+      {"no Backup", ProductionSigned(without("Backup")),
+       "required key (Info, App, AppData, or Manifest) not found: (null)"},
+      {"no AppData", ProductionSigned(without("AppData")),
+       "required key (Info, App, AppData, or Manifest) not found: (null)"},
+      {"no payload version", ProductionSigned(without("Version")), "required key (version) not found."},
+      {"not a property list", Bytes{'n', 'o', 'p', 'e'}, nullptr},
+  };
+  for (const auto& c : cases) {
+    LogCapture log;
+    const bool read = VTRSignedManifest::signedManifestWithBytes(c.file, anchors_).has_value();
+    EXPECT_EQ(read, c.lastMessage == nullptr && std::string(c.name) != "not a property list") << c.name;
+    if (c.lastMessage != nullptr) {
+      ASSERT_FALSE(log.messages().empty()) << c.name;
+      EXPECT_EQ(log.messages().back(), init + c.lastMessage) << c.name;
+    }
+  }
+  LogCapture log;
+  EXPECT_FALSE(VTRSignedManifest::signedManifestWithBytes(Bytes{'n', 'o', 'p', 'e'}, anchors_));
+  ASSERT_EQ(log.messages().size(), 1u);
+  EXPECT_EQ(log.messages()[0].rfind(init + "Cannot convert to property list - ", 0), 0u) << log.messages()[0];
+}
+
+TEST_F(SignedManifestTest, TheChainMustBeTrustedAndTheSignatureGood) {
+  const std::string create = "-[VTRSignedManifest createPublicKey:usingPolicy:]: ";
+  const std::string notValid = "-[VTRSignedManifest verifyManifestSignature:]: Certificate not valid.";
+  SetFuse(1);
+  const struct {
+    const char* name;
+    Bytes file;
+    std::vector<std::string> messages;
+  } cases[] = {
+      {"a flipped payload byte",
+       Signed(Payload(), {Pki("signer.der"), Pki("intermediate.der")}, Pki("signer.key"), Value::Integer(2), true),
+       {"Verifing strong signing"}},
+      {"signed by another key", Signed(Payload(), {Pki("signer.der"), Pki("intermediate.der")}, Pki("unfit.key")),
+       {"Verifing strong signing"}},
+      {"no intermediate", Signed(Payload(), {Pki("signer.der")}, Pki("signer.key")),
+       {"Verifing strong signing", create + "certificate trust evaluation failed: 5", notValid}},
+      {"a leaf unfit to sign", Signed(Payload(), {Pki("unfit.der"), Pki("intermediate.der")}, Pki("unfit.key")),
+       {"Verifing strong signing", create + "certificate trust evaluation failed: 5", notValid}},
+      {"test-signed on fused hardware", Signed(Payload(), {Pki("test-signer.der")}, Pki("test-signer.key")),
+       {"Verifing strong signing", create + "certificate trust evaluation failed: 5", notValid}},
+  };
+  for (const auto& c : cases) {
+    LogCapture log;
+    EXPECT_FALSE(VTRSignedManifest::signedManifestWithBytes(c.file, anchors_).has_value()) << c.name;
+    EXPECT_EQ(log.messages(), c.messages) << c.name;
+  }
+
+  // A certificate that is not DER ends the attempt under the policy.
+  Bytes garbled = Signed(Payload(), {Pki("signer.der")}, Pki("signer.key"));
+  Result<Value> outer = ReadPropertyList(garbled);
+  ASSERT_TRUE(outer.ok());
+  DictionaryBuilder builder;
+  for (const auto& [k, v] : *outer->dictionary()) {
+    builder.add(k, k == "Certificate" ? Value::ArrayOf({Value::Data({0x30, 0x03, 1, 2})}) : v);
+  }
+  LogCapture log;
+  EXPECT_FALSE(VTRSignedManifest::signedManifestWithBytes(*EncodeBinaryPropertyList(builder.build()), anchors_));
+  EXPECT_TRUE(log.contains("__49-[VTRSignedManifest createPublicKey:usingPolicy:]_block_invoke: Cannot load certificate."));
+}
+
+TEST_F(SignedManifestTest, DevelopmentSigningOnlyOnHardwareThatSaysItIsNotFused) {
+  const Bytes testSigned = Signed(Payload(), {Pki("test-signer.der")}, Pki("test-signer.key"));
+  for (const auto& [fuse, accepted] : {std::pair{1, false}, std::pair{-1, false}, std::pair{0, true}}) {
+    SetFuse(fuse);
+    LogCapture log;
+    EXPECT_EQ(VTRSignedManifest::signedManifestWithBytes(testSigned, anchors_).has_value(), accepted) << fuse;
+    EXPECT_EQ(log.contains("Verifing development signing"), fuse == 0) << fuse;
+  }
+  // A truncated variable is no answer.
+  WriteFile(efi_ / "SecureBoot-8be4df61-93ca-11d2-aa0d-00e098032b8c", std::string("\x06\x00\x00\x00", 4));
+  EXPECT_EQ(SigningFuse(efi_.path()), std::nullopt);
+  // Without anchors a policy cannot be created.
+  anchors_.production = pki_->path() + "/missing";
+  LogCapture log;
+  EXPECT_FALSE(VTRSignedManifest::signedManifestWithBytes(ProductionSigned(Payload()), anchors_));
+  EXPECT_TRUE(log.contains("-[VTRSignedManifest createPublicKeyForStrongSigning:]: Cannot create policy."));
+}
+
+TEST_F(SignedManifestTest, AnExpiredSignerIsNotTrusted) {
+  // Issued by the intermediate, valid two years ago for a year.
+  FILE* keyFile = std::fopen(Pki("intermediate.key").c_str(), "r");
+  FILE* caFile = std::fopen(Pki("intermediate.pem").c_str(), "r");
+  ASSERT_TRUE(keyFile && caFile);
+  EVP_PKEY* caKey = PEM_read_PrivateKey(keyFile, nullptr, nullptr, nullptr);
+  X509* ca = PEM_read_X509(caFile, nullptr, nullptr, nullptr);
+  std::fclose(keyFile);
+  std::fclose(caFile);
+  X509* expired = X509_new();
+  X509_set_version(expired, 2);
+  ASN1_INTEGER_set(X509_get_serialNumber(expired), 99);
+  X509_set_issuer_name(expired, X509_get_subject_name(ca));
+  X509_NAME* subject = X509_NAME_new();
+  X509_NAME_add_entry_by_txt(subject, "CN", MBSTRING_ASC, reinterpret_cast<const unsigned char*>("expired"), -1, -1, 0);
+  X509_set_subject_name(expired, subject);
+  X509_NAME_free(subject);
+  X509_gmtime_adj(X509_getm_notBefore(expired), -2L * 365 * 86400);
+  X509_gmtime_adj(X509_getm_notAfter(expired), -1L * 365 * 86400);
+  X509_set_pubkey(expired, caKey);
+  ASSERT_GT(X509_sign(expired, caKey, EVP_sha1()), 0);
+  unsigned char* der = nullptr;
+  const int length = i2d_X509(expired, &der);
+  WriteFile(Pki("expired.der"), std::string(reinterpret_cast<char*>(der), static_cast<size_t>(length)));
+  OPENSSL_free(der);
+  X509_free(expired);
+  X509_free(ca);
+  EVP_PKEY_free(caKey);
+
+  LogCapture log;
+  EXPECT_FALSE(VTRSignedManifest::signedManifestWithBytes(
+      Signed(Payload(), {Pki("expired.der"), Pki("intermediate.der")}, Pki("intermediate.key")), anchors_));
+  EXPECT_TRUE(log.contains("-[VTRSignedManifest createPublicKey:usingPolicy:]: certificate trust evaluation failed: 5"));
+}
+
+}  // namespace
+}  // namespace vtr
