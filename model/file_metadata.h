@@ -147,6 +147,14 @@ class VTRFileMetadata {
   // YES despite an extended attribute that failed, and a link answers exactly
   // whether its extended attributes were set. This asymmetry is deliberate.
   bool restoreAttribuesToPath(const std::string& path) const;
+  // The same onto the entry name of the open directory dirFd ("." for the
+  // directory itself), nothing resolved but that name and no link followed:
+  // a symbolic link gets its own owner and extended attributes; a regular
+  // file or directory is opened and set through its descriptor (a file with
+  // more than one link is never given to anyone but root); anything else fails
+  // the attributes step. path names the item in messages. dirFd stays the
+  // caller's.
+  bool restoreAttribuesToItemAt(int dirFd, const std::string& name, const std::string& path) const;
 
   // The first difference from other, as a VTRFileComparison code: other
   // absent; type (an absent type here counts as different); content hash of

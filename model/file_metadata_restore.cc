@@ -1,4 +1,6 @@
 // Using a file metadata record: laying it onto an item, comparing two.
+#include <fcntl.h>
+#include <sys/stat.h>
 #include <sys/xattr.h>
 
 #include <array>
@@ -7,6 +9,8 @@
 #include "model/file_metadata.h"
 #include "model/log.h"
 #include "platform/file_manager.h"
+#include "platform/file_tree.h"
+#include "platform/unique_fd.h"
 
 namespace vtr {
 namespace {
@@ -38,9 +42,11 @@ int32_t Int32Attribute(const Dictionary* attributes, const char* key) {
   return 0;
 }
 
-// Sets the record's extended attributes in name order; false at the first
-// that cannot be set.
-bool SetExtendedAttributes(const Dictionary* attributes, const std::string& path) {
+// Sets the record's extended attributes in name order with set(name,
+// value) (0 or -1 as setxattr answers); false, after its message, at the
+// first that cannot be set.
+template <typename Setter>
+bool SetExtendedAttributesWith(const Dictionary* attributes, const std::string& path, const Setter& set) {
   if (attributes == nullptr) return true;
   for (const auto& [name, value] : *attributes) {
     if (name.empty() || name.find('\0') != std::string::npos) {
@@ -52,12 +58,20 @@ bool SetExtendedAttributes(const Dictionary* attributes, const std::string& path
       VTRLog("Got non-data value");
       return false;
     }
-    if (::lsetxattr(path.c_str(), name.c_str(), data->data(), data->size(), 0) != 0) {
+    if (set(name, *data) != 0) {
       VTRLog("Could not set extended attributes on %@", path);
       return false;
     }
   }
   return true;
+}
+
+// Sets the record's extended attributes in name order; false at the first
+// that cannot be set.
+bool SetExtendedAttributes(const Dictionary* attributes, const std::string& path) {
+  return SetExtendedAttributesWith(attributes, path, [&path](const std::string& name, const Bytes& data) {
+    return ::lsetxattr(path.c_str(), name.c_str(), data.data(), data.size(), 0);
+  });
 }
 
 // Extended attributes without the one that is not compared.
@@ -116,6 +130,45 @@ bool VTRFileMetadata::restoreAttribuesToPath(const std::string& path) const {
   }
   const bool extendedAttributesSet = SetExtendedAttributes(getExtendedAttributes(), path);
   return attributesSet || extendedAttributesSet;
+}
+
+bool VTRFileMetadata::restoreAttribuesToItemAt(int dirFd, const std::string& name, const std::string& path) const {
+  const Dictionary* attributes = getFileAttributes();
+  const std::string* type = getFileType();
+  if (type != nullptr && *type == kNSFileTypeSymbolicLink) {
+    // A link's own owner; Linux gives links no mode. The result is not
+    // checked, as on the platform.
+    (void)::fchownat(dirFd, name.c_str(), static_cast<uid_t>(Int32Attribute(attributes, kNSFileOwnerAccountID)),
+                     static_cast<gid_t>(Int32Attribute(attributes, kNSFileGroupOwnerAccountID)), AT_SYMLINK_NOFOLLOW);
+    return SetExtendedAttributesWith(getExtendedAttributes(), path, [&](const std::string& key, const Bytes& data) {
+      return SetExtendedAttributeAt(dirFd, name, key, data.data(), data.size());
+    });
+  }
+  const Dictionary allowed = attributes != nullptr ? fileAttributesAllowSet(*attributes) : Dictionary();
+  // Only a regular file or a directory is opened: a device's open could
+  // reach its driver, a fifo's block.
+  UniqueFd item;
+  struct stat st;
+  Status set = Status::Ok();
+  if (::fstatat(dirFd, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) {
+    set = Error::FromErrno(path);
+  } else if (!S_ISREG(st.st_mode) && !S_ISDIR(st.st_mode)) {
+    set = Error(S_ISLNK(st.st_mode) ? ELOOP : EOPNOTSUPP, path);
+  } else {
+    item.reset(::openat(dirFd, name.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+    set = item ? SetAttributesOfDescriptor(allowed, item.get(), path) : Status(Error::FromErrno(path));
+  }
+  if (!set.ok()) {
+    VTRLog("Could not set file attributs at %@ with error - %@, attributes = %@", path, set.error(),
+           Value::DictionaryOf(allowed));
+    return false;
+  }
+  // The protection class has no Linux counterpart: setting it succeeds
+  // without effect, so its step cannot fail here.
+  SetExtendedAttributesWith(getExtendedAttributes(), path, [&item](const std::string& key, const Bytes& data) {
+    return ::fsetxattr(item.get(), key.c_str(), data.data(), data.size(), 0);
+  });
+  return true;
 }
 
 int VTRFileMetadata::compareWith(const VTRFileMetadata* other) const {

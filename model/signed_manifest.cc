@@ -94,7 +94,7 @@ std::optional<Bytes> VTRSignedManifest::verifyManifestSignature(const Value& out
   if (!key) {
     VTRDebugLog("Failed in strong signing verification.");
     // Development signing only on hardware that says it is not fused.
-    if (SigningFuse(anchors.efiVariables) == false) {
+    if (SigningFuse(anchors.efiVariables, anchors.rootFd) == false) {
       VTRDebugLog("Trying development signing on development hardware...");
       key = createPublicKeyForDevelopmentSigning(certificates, anchors);
     }
@@ -114,7 +114,7 @@ std::optional<Bytes> VTRSignedManifest::verifyManifestSignature(const Value& out
 
 PublicKey VTRSignedManifest::createPublicKeyForStrongSigning(const Value& certificates,
                                                              const SigningAnchors& anchors) {
-  Result<TrustPolicy> policy = TrustPolicy::Create(anchors.production);
+  Result<TrustPolicy> policy = TrustPolicy::Create(anchors.production, anchors.rootFd);
   if (!policy.ok()) {
     VTRLog("%s: Cannot create policy.", kStrong);
     return nullptr;
@@ -131,7 +131,7 @@ PublicKey VTRSignedManifest::createPublicKeyForDevelopmentSigning(const Value& c
 
 PublicKey VTRSignedManifest::createPublicKeyForDevelopmentSigningStandard(const Value& certificates,
                                                                           const SigningAnchors& anchors) {
-  Result<TrustPolicy> policy = TrustPolicy::Create(anchors.test);
+  Result<TrustPolicy> policy = TrustPolicy::Create(anchors.test, anchors.rootFd);
   if (!policy.ok()) {
     VTRLog("%s: Cannot create policy.", kDevelopmentStandard);
     return nullptr;

@@ -15,6 +15,8 @@
 #ifndef VTR_MODEL_SIGNED_MANIFEST_H_
 #define VTR_MODEL_SIGNED_MANIFEST_H_
 
+#include <fcntl.h>
+
 #include <cstdint>
 #include <optional>
 #include <span>
@@ -27,11 +29,13 @@
 namespace vtr {
 
 // Where the trust anchors of the two policies lie, and where the device
-// tells whether it is fused (inside the sandbox root under --root).
+// tells whether it is fused (inside the sandbox root under --root): absolute
+// paths resolved beneath rootFd (AT_FDCWD: as they stand).
 struct SigningAnchors {
   std::string production = "/usr/share/vitd/anchors/production";
   std::string test = "/usr/share/vitd/anchors/test";
   std::string efiVariables = kEfiVariablesFolder;
+  int rootFd = AT_FDCWD;
 };
 
 class VTRSignedManifest {

@@ -8,9 +8,10 @@
 
 namespace vtr {
 
-std::optional<bool> SigningFuse(const std::string& efivarsFolder) {
-  const std::string path = efivarsFolder + "/SecureBoot-8be4df61-93ca-11d2-aa0d-00e098032b8c";
-  UniqueFd fd(::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+std::optional<bool> SigningFuse(const std::string& efivarsFolder, int rootFd) {
+  std::string path = efivarsFolder + "/SecureBoot-8be4df61-93ca-11d2-aa0d-00e098032b8c";
+  if (rootFd != AT_FDCWD) path = path.substr(path.find_first_not_of('/'));
+  UniqueFd fd(::openat(rootFd, path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
   if (!fd) return std::nullopt;
   Result<std::string> bytes = ReadFully(fd.get(), 64);
   if (!bytes.ok() || bytes->size() < 5) return std::nullopt;

@@ -3,6 +3,8 @@
 #ifndef VTR_PLATFORM_DEVICE_PROPERTIES_H_
 #define VTR_PLATFORM_DEVICE_PROPERTIES_H_
 
+#include <fcntl.h>
+
 #include <optional>
 #include <string>
 
@@ -15,7 +17,9 @@ inline constexpr char kEfiVariablesFolder[] = "/sys/firmware/efi/efivars";
 // SecureBoot-8be4df61-93ca-11d2-aa0d-00e098032b8c in efivarsFolder: 4
 // attribute bytes, then one byte, 1 fused and 0 not. No variable, one
 // shorter than 5 bytes or a value byte other than 0 and 1: no answer.
-std::optional<bool> SigningFuse(const std::string& efivarsFolder = kEfiVariablesFolder);
+// The folder is an absolute path resolved beneath rootFd (AT_FDCWD: as it
+// stands).
+std::optional<bool> SigningFuse(const std::string& efivarsFolder = kEfiVariablesFolder, int rootFd = AT_FDCWD);
 
 }  // namespace vtr
 

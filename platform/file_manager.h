@@ -117,6 +117,13 @@ enum class LinkAtPath {
 Status SetAttributes(const Dictionary& attributes, const std::string& path,
                      LinkAtPath linkAtPath = LinkAtPath::kOwnerOnly);
 
+// SetAttributes on the regular file or directory open as fd (read-only will
+// do), nothing resolved: a descriptor of another kind fails with
+// EOPNOTSUPP. A regular file with more than one link is never given to an
+// owner or group other than root (EMLINK, nothing changed): the inode lives
+// elsewhere too.
+Status SetAttributesOfDescriptor(const Dictionary& attributes, int fd, const std::string& pathForErrors);
+
 // Owner and group of the item at path itself (a symbolic link is changed,
 // not followed). An id of -1 leaves that one as it is.
 Status ChangeOwnerOfItem(const std::string& path, uid_t uid, gid_t gid);

@@ -124,21 +124,25 @@ FileFlags FlagsFromStatx(const struct statx& stx) {
   return FileFlags{has(STATX_ATTR_IMMUTABLE), has(STATX_ATTR_APPEND)};
 }
 
-// Sets the flags of a regular file or directory. The descriptor is opened
-// without following a link and without blocking, and its type checked
-// before the ioctl: on a device the request would reach the driver.
+// Sets the flags of the regular file or directory open as fd (its type
+// checked before the ioctl: on a device the request would reach the driver).
+Status SetFlagsOfDescriptor(int fd, FileFlags wanted, const std::string& path) {
+  struct stat st;
+  if (::fstat(fd, &st) != 0) return Error::FromErrno(path);
+  if (!S_ISREG(st.st_mode) && !S_ISDIR(st.st_mode)) return Error(EOPNOTSUPP, path);
+  int flags = 0;
+  if (::ioctl(fd, FS_IOC_GETFLAGS, &flags) != 0) return Error::FromErrno(path);
+  flags = wanted.immutable ? (flags | FS_IMMUTABLE_FL) : (flags & ~FS_IMMUTABLE_FL);
+  flags = wanted.appendOnly ? (flags | FS_APPEND_FL) : (flags & ~FS_APPEND_FL);
+  if (::ioctl(fd, FS_IOC_SETFLAGS, &flags) != 0) return Error::FromErrno(path);
+  return Status::Ok();
+}
+
+// The same at path, opened without following a link and without blocking.
 Status SetFlags(const std::string& path, FileFlags wanted) {
   UniqueFd fd(::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
   if (!fd) return Error::FromErrno(path);
-  struct stat st;
-  if (::fstat(fd.get(), &st) != 0) return Error::FromErrno(path);
-  if (!S_ISREG(st.st_mode) && !S_ISDIR(st.st_mode)) return Error(EOPNOTSUPP, path);
-  int flags = 0;
-  if (::ioctl(fd.get(), FS_IOC_GETFLAGS, &flags) != 0) return Error::FromErrno(path);
-  flags = wanted.immutable ? (flags | FS_IMMUTABLE_FL) : (flags & ~FS_IMMUTABLE_FL);
-  flags = wanted.appendOnly ? (flags | FS_APPEND_FL) : (flags & ~FS_APPEND_FL);
-  if (::ioctl(fd.get(), FS_IOC_SETFLAGS, &flags) != 0) return Error::FromErrno(path);
-  return Status::Ok();
+  return SetFlagsOfDescriptor(fd.get(), wanted, path);
 }
 
 }  // namespace
@@ -181,6 +185,44 @@ Status SetAttributes(const Dictionary& attributes, const std::string& path, Link
     if (::utimensat(AT_FDCWD, path.c_str(), times, AT_SYMLINK_NOFOLLOW) != 0) return Error::FromErrno(path);
   }
   if (wanted != current) return SetFlags(path, wanted);
+  return Status::Ok();
+}
+
+Status SetAttributesOfDescriptor(const Dictionary& attributes, int fd, const std::string& pathForErrors) {
+  const std::string& path = pathForErrors;
+  Result<AttributeChanges> changes = PlanChanges(attributes, path);
+  if (!changes.ok()) return changes.error();
+  if (changes->empty()) return Status::Ok();
+  struct statx stx;
+  if (::statx(fd, "", AT_EMPTY_PATH, STATX_TYPE | STATX_MODE | STATX_NLINK | STATX_UID | STATX_GID, &stx) != 0) {
+    return Error::FromErrno(path);
+  }
+  if (!S_ISREG(stx.stx_mode) && !S_ISDIR(stx.stx_mode)) return Error(EOPNOTSUPP, path);
+  // A file linked elsewhere too would hand over an inode that lives there:
+  // it may go to root, never to anyone else.
+  const bool handedOver = (changes->owner && *changes->owner != stx.stx_uid && *changes->owner != 0) ||
+                          (changes->group && *changes->group != stx.stx_gid && *changes->group != 0);
+  if (S_ISREG(stx.stx_mode) && stx.stx_nlink > 1 && handedOver) {
+    return Error(EMLINK, path + " has more than one link and is never given another owner");
+  }
+  FileFlags current = FlagsFromStatx(stx);
+  const FileFlags wanted{changes->immutable.value_or(current.immutable),
+                         changes->appendOnly.value_or(current.appendOnly)};
+  if (current.any() && changes->changesInode()) {
+    if (Status unlocked = SetFlagsOfDescriptor(fd, FileFlags{}, path); !unlocked.ok()) return unlocked;
+    current = FileFlags{};
+  }
+  // Owner before mode: a change of owner clears the set-id bits.
+  if ((changes->owner || changes->group) &&
+      ::fchown(fd, changes->owner.value_or(static_cast<uid_t>(-1)), changes->group.value_or(static_cast<gid_t>(-1))) != 0) {
+    return Error::FromErrno(path);
+  }
+  if (changes->mode && ::fchmod(fd, *changes->mode) != 0) return Error::FromErrno(path);
+  if (changes->modificationTime) {
+    const struct timespec times[2] = {{0, UTIME_OMIT}, *changes->modificationTime};
+    if (::futimens(fd, times) != 0) return Error::FromErrno(path);
+  }
+  if (wanted != current) return SetFlagsOfDescriptor(fd, wanted, path);
   return Status::Ok();
 }
 

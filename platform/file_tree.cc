@@ -28,6 +28,9 @@
 #ifndef SYS_getxattrat
 #define SYS_getxattrat 464
 #endif
+#ifndef SYS_setxattrat
+#define SYS_setxattrat 463
+#endif
 #ifndef SYS_listxattrat
 #define SYS_listxattrat 465
 #endif
@@ -348,6 +351,17 @@ ssize_t GetExtendedAttributeAt(int dirFd, const std::string& name, const std::st
     return -1;
   }
   return ::lgetxattr(fallbackPath->c_str(), key.c_str(), value, size);
+}
+
+int SetExtendedAttributeAt(int dirFd, const std::string& name, const std::string& key, const void* value,
+                           size_t size) {
+  if (size > UINT32_MAX) {
+    errno = E2BIG;
+    return -1;
+  }
+  XattrArgs args{reinterpret_cast<uintptr_t>(value), static_cast<uint32_t>(size), 0};
+  return static_cast<int>(
+      ::syscall(SYS_setxattrat, dirFd, name.c_str(), AT_SYMLINK_NOFOLLOW, key.c_str(), &args, sizeof args));
 }
 
 Status ReplicateItem(int srcDir, const std::string& srcName, int dstDir, const std::string& dstName,

@@ -51,6 +51,13 @@ ssize_t GetExtendedAttributeAt(int dirFd, const std::string& name, const std::st
 // copy of it will need at least.
 Result<uint64_t> AllocatedBytesOfTree(int dirFd, const std::string& name, const std::string& pathForErrors);
 
+// Sets the extended attribute key of the entry name of dirFd itself, a
+// symbolic link there not followed (setxattrat, Linux 6.13): 0, or -1 with
+// errno (ENOSYS on older kernels, where nothing reaches a link's own
+// attributes without resolving a path again).
+int SetExtendedAttributeAt(int dirFd, const std::string& name, const std::string& key, const void* value,
+                           size_t size);
+
 // How ReplicateItem makes the files of the copy.
 enum class Replication {
   kCopy,      // new files with the source's data, mode, owner, times and extended attributes

@@ -1,6 +1,6 @@
 #include "platform/trust_policy.h"
 
-#include <dirent.h>
+#include <fcntl.h>
 #include <openssl/err.h>
 #include <openssl/evp.h>
 #include <openssl/pem.h>
@@ -10,8 +10,11 @@
 
 #include <algorithm>
 #include <cstdio>
+#include <unistd.h>
 
+#include "platform/file_tree.h"
 #include "platform/format.h"
+#include "platform/unique_fd.h"
 
 namespace vtr {
 namespace {
@@ -48,10 +51,14 @@ Certificate FromDer(const Bytes& der) {
   return certificate;
 }
 
-// Adds every certificate of the PEM file at path to store; how many.
-int AddPemFile(X509_STORE* store, const std::string& path) {
-  FILE* file = std::fopen(path.c_str(), "re");
-  if (file == nullptr) return 0;
+// Adds every certificate of the PEM file name in dir to store; how many.
+int AddPemFile(X509_STORE* store, int dir, const std::string& name) {
+  const int fd = ::openat(dir, name.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC);
+  FILE* file = fd >= 0 ? ::fdopen(fd, "r") : nullptr;
+  if (file == nullptr) {
+    if (fd >= 0) ::close(fd);
+    return 0;
+  }
   int added = 0;
   while (X509* certificate = PEM_read_X509(file, nullptr, nullptr, nullptr)) {
     if (X509_STORE_add_cert(store, certificate) == 1) ++added;
@@ -66,21 +73,20 @@ int AddPemFile(X509_STORE* store, const std::string& path) {
 
 void PublicKeyFree::operator()(evp_pkey_st* key) const { EVP_PKEY_free(key); }
 
-Result<TrustPolicy> TrustPolicy::Create(const std::string& folder) {
-  DIR* dir = ::opendir(folder.c_str());
-  if (dir == nullptr) return Error::FromErrno(folder);
-  std::vector<std::string> files;
-  while (struct dirent* entry = ::readdir(dir)) {
-    const std::string name = entry->d_name;
-    if (name.size() > 4 && name.compare(name.size() - 4, 4, ".pem") == 0) files.push_back(folder + "/" + name);
-  }
-  ::closedir(dir);
-  std::sort(files.begin(), files.end());
+Result<TrustPolicy> TrustPolicy::Create(const std::string& folder, int rootFd) {
+  const std::string relative = rootFd == AT_FDCWD ? folder : folder.substr(folder.find_first_not_of('/'));
+  UniqueFd dir(::openat(rootFd, relative.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!dir) return Error::FromErrno(folder);
+  Result<std::vector<std::string>> names = DirectoryEntryNames(dir.get(), folder);
+  if (!names.ok()) return names.error();
+  std::sort(names->begin(), names->end());
   X509_STORE* store = X509_STORE_new();
   if (store == nullptr) return Error(ENOMEM, "X509_STORE_new");
   TrustPolicy policy(store);
   int anchors = 0;
-  for (const std::string& file : files) anchors += AddPemFile(store, file);
+  for (const std::string& name : *names) {
+    if (name.size() > 4 && name.compare(name.size() - 4, 4, ".pem") == 0) anchors += AddPemFile(store, dir.get(), name);
+  }
   if (anchors == 0) return Error(ENOENT, folder + " holds no certificate");
   return policy;
 }

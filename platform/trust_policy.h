@@ -14,6 +14,8 @@
 #ifndef VTR_PLATFORM_TRUST_POLICY_H_
 #define VTR_PLATFORM_TRUST_POLICY_H_
 
+#include <fcntl.h>
+
 #include <memory>
 #include <span>
 #include <string>
@@ -51,9 +53,10 @@ struct TrustEvaluation {
 
 class TrustPolicy {
  public:
-  // The policy of the PEM certificates in folder. An Error when the folder
-  // is missing or holds no certificate: the policy cannot be created.
-  static Result<TrustPolicy> Create(const std::string& folder);
+  // The policy of the PEM certificates in folder, an absolute path resolved
+  // beneath rootFd (AT_FDCWD: as it stands). An Error when the folder is
+  // missing or holds no certificate: the policy cannot be created.
+  static Result<TrustPolicy> Create(const std::string& folder, int rootFd = AT_FDCWD);
 
   TrustPolicy(TrustPolicy&&) noexcept;
   TrustPolicy& operator=(TrustPolicy&&) noexcept;

@@ -15,6 +15,7 @@ constexpr std::array kCommands = {
     Command{"removeWorkContainer:", &R::removeWorkContainer},
     Command{"createDeviceManifest:", &R::createDeviceManifest},
     Command{"createHardLink:", &R::createHardLink},
+    Command{"restoreAttributes:", &R::restoreAttributes},
     Command{"moveStagingToFinal:", &R::moveStagingToFinal},
 };
 

@@ -28,6 +28,19 @@ bool VTRHMessageResponder::createHardLink(const Value& parameter) {
                                                           StringEntry(parameter, "StagingPath"));
 }
 
+bool VTRHMessageResponder::restoreAttributes(const Value& parameter) {
+  VTRLog("Entering %s with parameter: %@", "-[VTRHMessageResponder restoreAttributes:]", parameter);
+  // A missing type or identifier (or one that is no string) is nil: the
+  // whole device.
+  const auto optionalString = [&parameter](std::string_view key) -> std::optional<std::string> {
+    const std::string* s = parameter.get(key).string();
+    return s ? std::optional<std::string>(*s) : std::nullopt;
+  };
+  return VTRHOperations::sharedInstance().restoreAttributesUnder(
+      StringEntry(parameter, "StagingRootPath"), StringEntry(parameter, "ManifestPath"), optionalString("ContentType"),
+      optionalString("Identifier"));
+}
+
 bool VTRHMessageResponder::moveStagingToFinal(const Value& parameter) {
   VTRLog("Entering %s with parameter: %@", "-[VTRHMessageResponder moveStagingToFinal:]", parameter);
   const std::string* path = parameter.string();

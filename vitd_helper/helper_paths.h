@@ -31,6 +31,11 @@ struct HelperPaths {
   std::string deviceManifest = "/private/var/VTRWorkContainer/DeviceManifest.plist";
   // moveStagingToFinal: where staged content ends.
   std::string finalLocation = "/var/backup";
+  // restoreAttributes: the trust anchors of the two signing policies and
+  // where the device says whether it is fused.
+  std::string productionAnchors = "/usr/share/vitd/anchors/production";
+  std::string testAnchors = "/usr/share/vitd/anchors/test";
+  std::string efiVariables = "/sys/firmware/efi/efivars";
   // The account files and folders are handed to.
   std::string mobileAccount = "mobile";
 };

@@ -65,6 +65,7 @@ class VTRHMessageResponder {
   bool removeWorkContainer(const Value& parameter);
   bool createDeviceManifest(const Value& parameter);
   bool createHardLink(const Value& parameter);
+  bool restoreAttributes(const Value& parameter);
   bool moveStagingToFinal(const Value& parameter);
 
  private:

@@ -15,6 +15,7 @@
 #define VTR_VITD_HELPER_OPERATIONS_H_
 
 #include <memory>
+#include <optional>
 #include <string>
 
 #include "platform/result.h"
@@ -76,6 +77,18 @@ class VTRHOperations {
   // Moves the staging directory (a real directory, no link) to the final
   // location, replacing what was there.
   bool moveStagingToFinal(const std::string& stagingPath);
+
+  // Reads and verifies the signed manifest at manifestPath, picks its file
+  // manifest (the whole device when containerType or identifier is absent;
+  // else the "AppData" entry's "Manifest", or the "GroupData" or
+  // "ExtensionData" entry itself) and lays every record onto the item at
+  // the same relative path under root, in key order; the first that fails
+  // ends the run. Both paths are client paths; every record's path is
+  // resolved beneath root's descriptor with no link followed and no "..",
+  // so nothing outside root changes.
+  bool restoreAttributesUnder(const std::string& root, const std::string& manifestPath,
+                              const std::optional<std::string>& containerType,
+                              const std::optional<std::string>& identifier);
 
  private:
   // The checked client path, or nullopt after the refusal is logged.

@@ -1,6 +1,5 @@
-// Signed manifests against a throwaway PKI the test makes with the openssl
-// tool: a production root and a test root (SHA-1 signed, as in the format's
-// era), an intermediate, signers fit and unfit to sign, and one expired.
+// Signed manifests against the throwaway PKI of tests/support/test_pki.h,
+// and a signer that expired, made here.
 #include "model/signed_manifest.h"
 
 #include <openssl/evp.h>
@@ -16,63 +15,27 @@
 #include <gtest/gtest.h>
 
 #include "platform/plist.h"
+#include "tests/support/test_pki.h"
 #include "tests/support/test_support.h"
 
 namespace vtr {
 namespace {
 
 using testing::LogCapture;
+using testing::TestPki;
 using testing::ReadFile;
 using testing::TempDir;
 using testing::WriteFile;
 
-Bytes FileBytes(const std::string& path) {
-  const std::string text = ReadFile(path);
-  return Bytes(text.begin(), text.end());
-}
-
 class SignedManifestTest : public ::testing::Test {
  protected:
-  static void SetUpTestSuite() {
-    pki_ = new TempDir();
-    const std::string d = pki_->path();
-    const std::string script = R"(set -e
-cd ")" + d + R"("
-mkdir -p production test
-printf 'basicConstraints=critical,CA:TRUE\nkeyUsage=critical,keyCertSign\n' > ca.ext
-printf 'keyUsage=critical,digitalSignature\n' > signer.ext
-printf 'keyUsage=critical,keyEncipherment\n' > unfit.ext
-root() { openssl req -x509 -newkey rsa:2048 -nodes -sha1 -days 3650 -keyout "$1.key" -out "$1.pem" -subj "/CN=$1" \
-  -addext 'basicConstraints=critical,CA:TRUE' -addext 'keyUsage=critical,keyCertSign' 2>/dev/null; }
-issue() { openssl req -newkey rsa:2048 -nodes -keyout "$1.key" -out "$1.csr" -subj "/CN=$1" 2>/dev/null
-  openssl x509 -req -sha1 -days 365 -in "$1.csr" -CA "$2.pem" -CAkey "$2.key" -CAcreateserial -out "$1.pem" \
-  -extfile "$3" 2>/dev/null
-  openssl x509 -in "$1.pem" -outform DER -out "$1.der"; }
-root production-root; root test-root
-cp production-root.pem production/; cp test-root.pem test/
-issue intermediate production-root ca.ext
-issue signer intermediate signer.ext
-issue unfit intermediate unfit.ext
-issue test-signer test-root signer.ext
-)";
-    ASSERT_EQ(std::system(("sh -c '" + Quote(script) + "'").c_str()), 0) << "the openssl tool failed";
-  }
-  static void TearDownTestSuite() { delete pki_; }
-
-  // Shell single quotes around text.
-  static std::string Quote(const std::string& text) {
-    std::string out;
-    for (char c : text) out += c == '\'' ? std::string("'\\''") : std::string(1, c);
-    return out;
-  }
-
   void SetUp() override {
-    anchors_.production = pki_->path() + "/production";
-    anchors_.test = pki_->path() + "/test";
+    anchors_.production = pki_.file("production");
+    anchors_.test = pki_.file("test");
     anchors_.efiVariables = efi_.path();
   }
 
-  static std::string Pki(const std::string& name) { return pki_->path() + "/" + name; }
+  static std::string Pki(const std::string& name) { return TestPki::Get().file(name); }
 
   static Value Payload(Value version = Value::Integer(3)) {
     const Value record = Value::DictionaryOf({{"VTRManifestFileHash", Value::Data({1, 2, 3})}});
@@ -85,32 +48,14 @@ issue test-signer test-root signer.ext
     });
   }
 
-  // The signature the openssl tool makes of bytes with key.
-  static Bytes Sign(const Bytes& bytes, const std::string& key) {
-    TempDir work;
-    WriteFile(work / "payload", std::string(bytes.begin(), bytes.end()));
-    const std::string command = "openssl dgst -sha1 -sign '" + key + "' -out '" + (work / "sig") + "' '" +
-                                (work / "payload") + "'";
-    EXPECT_EQ(std::system(command.c_str()), 0);
-    return FileBytes(work / "sig");
-  }
-
-  // A signed manifest file's bytes, with every part replaceable.
+  // A signed manifest: chain names .der files of the PKI, key a .key file.
   static Bytes Signed(const Value& payload, const std::vector<std::string>& chain, const std::string& key,
                       Value version = Value::Integer(2), bool flipPayload = false) {
-    Bytes payloadBytes = *EncodeBinaryPropertyList(payload);
-    const Bytes signature = Sign(payloadBytes, key);
-    if (flipPayload) payloadBytes[payloadBytes.size() / 2] ^= 1;
-    Array certificates;
-    for (const std::string& der : chain) certificates.push_back(Value::Data(FileBytes(der)));
-    return *EncodeBinaryPropertyList(Value::DictionaryOf({{"Version", version},
-                                                         {"Certificate", Value::ArrayOf(certificates)},
-                                                         {"Payload", Value::Data(payloadBytes)},
-                                                         {"Signature", Value::Data(signature)}}));
+    std::vector<std::string> names;
+    for (const std::string& path : chain) names.push_back(path.substr(path.rfind('/') + 1));
+    return TestPki::Get().signedManifest(payload, names, key.substr(key.rfind('/') + 1), version, flipPayload);
   }
-  static Bytes ProductionSigned(const Value& payload) {
-    return Signed(payload, {Pki("signer.der"), Pki("intermediate.der")}, Pki("signer.key"));
-  }
+  static Bytes ProductionSigned(const Value& payload) { return TestPki::Get().productionSigned(payload); }
 
   // The device's Secure Boot answer: 1 fused, 0 not, -1 none.
   void SetFuse(int value) {
@@ -119,12 +64,10 @@ issue test-signer test-root signer.ext
     if (value >= 0) WriteFile(path, std::string("\x06\x00\x00\x00", 4) + static_cast<char>(value));
   }
 
-  static TempDir* pki_;
+  const TestPki& pki_ = TestPki::Get();
   TempDir efi_;
   SigningAnchors anchors_;
 };
-
-TempDir* SignedManifestTest::pki_ = nullptr;
 
 TEST_F(SignedManifestTest, AProductionSignedManifestIsReadWithItsParts) {
   LogCapture log;
@@ -239,7 +182,7 @@ TEST_F(SignedManifestTest, DevelopmentSigningOnlyOnHardwareThatSaysItIsNotFused)
   WriteFile(efi_ / "SecureBoot-8be4df61-93ca-11d2-aa0d-00e098032b8c", std::string("\x06\x00\x00\x00", 4));
   EXPECT_EQ(SigningFuse(efi_.path()), std::nullopt);
   // Without anchors a policy cannot be created.
-  anchors_.production = pki_->path() + "/missing";
+  anchors_.production = Pki("missing");
   LogCapture log;
   EXPECT_FALSE(VTRSignedManifest::signedManifestWithBytes(ProductionSigned(Payload()), anchors_));
   EXPECT_TRUE(log.contains("-[VTRSignedManifest createPublicKeyForStrongSigning:]: Cannot create policy."));

@@ -3,10 +3,13 @@
 #include <sys/xattr.h>
 #include <unistd.h>
 
+#include <cstdlib>
+
 #include <gtest/gtest.h>
 
 #include "platform/plist.h"
 #include "tests/support/file_inspection.h"
+#include "tests/support/test_pki.h"
 #include "tests/support/test_support.h"
 #include "tests/vitd_helper/helper_sandbox.h"
 
@@ -169,6 +172,47 @@ TEST_F(ManifestTest, HardLinksAndMoveToFinal) {
   EXPECT_TRUE(Exists(sandbox_.host("/private/var/backup/Media/photo.jpg")));
   EXPECT_FALSE(Exists(sandbox_.host("/private/var/staging")));
   EXPECT_TRUE(sandbox_.logged("Move the whole thing together."));
+}
+
+TEST_F(ManifestTest, RestoreAttributesFromASignedManifestOfTheHelpersOwnRecords) {
+  // The vendor's record of mobile's Library, signed; the anchors in the root.
+  ASSERT_EQ(createDeviceManifest("/private/var/mobile/Library", true).back(),
+            XpcObject::Dictionary({{"Response", XpcObject::Bool(true)}}));
+  Result<Value> records = ReadPropertyListFile(sandbox_.host(kManifest));
+  ASSERT_TRUE(records.ok());
+  const TestPki& pki = TestPki::Get();
+  const std::string anchors = sandbox_.host("/usr/share/vitd/anchors/production");
+  ASSERT_EQ(std::system(("mkdir -p '" + anchors + "' && cp '" + pki.file("production") + "'/*.pem '" + anchors + "'").c_str()), 0);
+  const Bytes signedManifest = pki.productionSigned(Value::DictionaryOf(
+      {{"Version", Value::Integer(4)}, {"Info", Value::String("demo")}, {"Backup", *records},
+       {"App", Value::ArrayOf({})}, {"AppData", Value::DictionaryOf({})}}));
+  WriteFile(sandbox_.host("/private/var/mobile/demo.plist"), std::string(signedManifest.begin(), signedManifest.end()));
+
+  // The same content laid down again by the daemon: mobile's, plain modes.
+  const std::string staging = sandbox_.host("/private/var/staging");
+  ASSERT_EQ(std::system(("cp -a '" + sandbox_.host("/private/var/mobile/Library") + "' '" + staging + "' && chown -hR 501:501 '" +
+                         staging + "' && chmod 0644 '" + staging + "/empty' && setfattr -x user.tag '" + staging +
+                         "/Media/photo.jpg'").c_str()),
+            0);
+  HelperSandbox::RunResult restored = sandbox_.run(
+      VitdctlExecutable(), {"--root", sandbox_.root(), "--timeout", "10", "restoreAttributes", "/private/var/staging",
+                            "/private/var/mobile/demo.plist"});
+  EXPECT_EQ(restored.output, "{\"Response\":true}\n");
+  EXPECT_EQ(restored.status, 0);
+  EXPECT_TRUE(sandbox_.logged("Loading signed manifest."));
+  EXPECT_TRUE(sandbox_.logged("Manifest passed signature check."));
+  EXPECT_EQ(Lstat(staging + "/empty").st_mode & 07777, 04751u);
+  EXPECT_EQ(Lstat(staging + "/empty").st_uid, kMobileUid);
+  EXPECT_EQ(Lstat(staging + "/Media/photo.jpg").st_uid, 0u);
+  EXPECT_EQ(Xattr(staging + "/Media/photo.jpg", "user.tag"), std::string("\x00\x01zz", 4));
+  EXPECT_EQ(Lstat(staging + "/link").st_uid, 0u);
+
+  // A container that is not there.
+  restored = sandbox_.run(VitdctlExecutable(), {"--root", sandbox_.root(), "--timeout", "10", "restoreAttributes",
+                                                "/private/var/staging", "/private/var/mobile/demo.plist", "--type",
+                                                "AppData", "--identifier", "com.none"});
+  EXPECT_EQ(restored.output, "{\"Response\":false}\n");
+  EXPECT_TRUE(sandbox_.logged("Couldn't load container data for AppData/com.none"));
 }
 
 }  // namespace

@@ -7,13 +7,17 @@
 #include <linux/fs.h>
 #include <sys/ioctl.h>
 #include <sys/stat.h>
+#include <sys/xattr.h>
 #include <unistd.h>
+
+#include <cstdlib>
 
 #include <gtest/gtest.h>
 
 #include "platform/accounts.h"
 #include "platform/plist.h"
 #include "tests/support/file_inspection.h"
+#include "tests/support/test_pki.h"
 #include "tests/support/test_support.h"
 
 namespace vtr::testing {
@@ -259,6 +263,149 @@ TEST_F(OperationsTest, ManifestsNeverRecordClosedTreesAndKeyATrailingSlashRootAs
   EXPECT_TRUE(logs->get("/").dictionary()) << "the root record of a trailing-slash tree";
   EXPECT_TRUE(logs->get("vitd").isNil());
   EXPECT_EQ(logs->dictionary()->size(), 1u);
+}
+
+// A demo tree as the vendor recorded it, the same content as the
+// unprivileged daemon lays it down, and a manifest signed over the record.
+class RestoreTest : public OperationsTest {
+ protected:
+  void SetUp() override {
+    OperationsTest::SetUp();
+    if (!IsRoot()) GTEST_SKIP() << "restores owners: needs root";
+    const TestPki& pki = TestPki::Get();
+    for (const char* policy : {"production", "test"}) {
+      const std::string folder = host(std::string("/usr/share/vitd/anchors/") + policy);
+      ASSERT_EQ(std::system(("mkdir -p '" + folder + "' && cp '" + pki.file(policy) + "'/*.pem '" + folder + "'").c_str()), 0);
+    }
+    // As recorded: root's, with modes, set-id bits, times and attributes.
+    const std::string demo = host("/private/var/mobile/Demo");
+    ASSERT_EQ(::mkdir(demo.c_str(), 0755), 0);
+    ASSERT_EQ(::mkdir((demo + "/d").c_str(), 0750), 0);
+    WriteFile(demo + "/d/f", "f");
+    ::chmod((demo + "/d/f").c_str(), 0640);
+    ASSERT_EQ(::setxattr((demo + "/d/f").c_str(), "user.a", "1", 1, 0), 0);
+    ASSERT_EQ(::setxattr((demo + "/d/f").c_str(), "trusted.t", "2", 1, 0), 0);
+    const struct timespec old[2] = {{1000000000, 0}, {1000000000, 0}};
+    ASSERT_EQ(::utimensat(AT_FDCWD, (demo + "/d/f").c_str(), old, 0), 0);
+    WriteFile(demo + "/d/g", "g");
+    ::chmod((demo + "/d/g").c_str(), 04755);
+    WriteFile(demo + "/d/m", "m");
+    ASSERT_EQ(::chown((demo + "/d/m").c_str(), kMobile, kMobile), 0);
+    ASSERT_EQ(::symlink("f", (demo + "/d/l").c_str()), 0);
+    ASSERT_TRUE(ops_.createDeviceManifest("/private/var/mobile/Demo", true));
+    Result<Value> manifest = ReadPropertyListFile(host("/private/var/VTRWorkContainer/DeviceManifest.plist"));
+    ASSERT_TRUE(manifest.ok());
+    const Value payload = Value::DictionaryOf({
+        {"Version", Value::Integer(3)},
+        {"Info", Value::String("demo")},
+        {"Backup", *manifest},
+        {"App", Value::ArrayOf({})},
+        {"AppData", Value::DictionaryOf({{"com.demo", Value::DictionaryOf({{"Manifest", *manifest}})}})},
+        {"GroupData", Value::DictionaryOf({{"group.demo", *manifest}})},
+    });
+    const Bytes signedManifest = pki.productionSigned(payload);
+    WriteFile(host("/private/var/mobile/m.plist"), std::string(signedManifest.begin(), signedManifest.end()));
+    LayDown();
+  }
+
+  // The content as the daemon lays it: mobile's, plain modes, no attributes.
+  void LayDown() {
+    const std::string staging = host("/private/var/staging");
+    ASSERT_EQ(std::system(("rm -rf '" + staging + "' && mkdir -p '" + staging + "/d'").c_str()), 0);
+    for (const char* file : {"/d/f", "/d/g", "/d/m"}) WriteFile(staging + file, "x");
+    ASSERT_EQ(::symlink("f", (staging + "/d/l").c_str()), 0);
+    ASSERT_EQ(std::system(("chown -hR 501:501 '" + staging + "'").c_str()), 0);
+  }
+
+  bool Restore(std::optional<std::string> type = std::nullopt, std::optional<std::string> id = std::nullopt) {
+    return ops_.restoreAttributesUnder("/private/var/staging", "/private/var/mobile/m.plist", type, id);
+  }
+};
+
+TEST_F(RestoreTest, EveryRecordIsLaidOntoTheContent) {
+  ASSERT_TRUE(Restore());
+  const std::string staging = host("/private/var/staging");
+  EXPECT_EQ(Lstat(staging + "/d").st_mode & 07777, 0750u);
+  EXPECT_EQ(Lstat(staging + "/d").st_uid, 0u);
+  const struct stat f = Lstat(staging + "/d/f");
+  EXPECT_EQ(f.st_mode & 07777, 0640u);
+  EXPECT_EQ(f.st_uid, 0u);
+  EXPECT_EQ(f.st_mtim.tv_sec, 1000000000);
+  EXPECT_EQ(Xattr(staging + "/d/f", "user.a"), "1");
+  EXPECT_EQ(Xattr(staging + "/d/f", "trusted.t"), "2");
+  EXPECT_EQ(Lstat(staging + "/d/g").st_mode & 07777, 04755u) << "set-id bits survive the change of owner";
+  EXPECT_EQ(Lstat(staging + "/d/m").st_uid, kMobile);
+  EXPECT_EQ(Lstat(staging + "/d/l").st_uid, 0u) << "a link gets its own owner";
+  EXPECT_EQ(Lstat(staging).st_mode & 07777, 0755u) << "the tree itself is the record \"/\"";
+}
+
+TEST_F(RestoreTest, TheContainerTypeAndIdentifierChooseTheManifest) {
+  const struct {
+    std::optional<std::string> type;
+    std::optional<std::string> id;
+    bool restored;
+    const char* message;
+  } cases[] = {
+      {"AppData", "com.demo", true, nullptr},
+      {"GroupData", "group.demo", true, nullptr},
+      {"AppData", std::nullopt, true, nullptr},
+      {std::nullopt, "anything", true, nullptr},
+      {"AppData", "nope", false, "Couldn't load container data for AppData/nope"},
+      {"GroupData", "nope", false, "Couldn't load manifest dict for GroupData/nope"},
+      {"ExtensionData", "com.demo", false, "Couldn't load manifest dict for ExtensionData/com.demo"},
+      {"appdata", "com.demo", false, "Couldn't load manifest dict for appdata/com.demo"},
+  };
+  for (const auto& c : cases) {
+    LayDown();
+    LogCapture log;
+    EXPECT_EQ(Restore(c.type, c.id), c.restored) << c.type.value_or("nil") << "/" << c.id.value_or("nil");
+    if (c.message != nullptr) {
+      EXPECT_EQ(log.messages().back(), c.message);
+      EXPECT_EQ(Lstat(host("/private/var/staging/d/f")).st_uid, kMobile) << "nothing restored";
+    }
+  }
+}
+
+TEST_F(RestoreTest, NothingOutsideTheStagingRootChangesThroughWhatTheClientPlanted) {
+  // A link where a directory was recorded, pointing outside.
+  ASSERT_EQ(std::system(("rm -rf '" + host("/private/var/staging/d") + "'").c_str()), 0);
+  ASSERT_EQ(::symlink(host("/etc").c_str(), host("/private/var/staging/d").c_str()), 0);
+  LogCapture log;
+  EXPECT_FALSE(Restore());
+  ASSERT_FALSE(log.messages().empty());
+  EXPECT_EQ(log.messages().back().rfind("Could not set file attributs at /private/var/staging/d with error - ", 0), 0u)
+      << log.messages().back();
+  // A record beneath it is never reached through the link either.
+  ASSERT_EQ(::unlink(host("/private/var/staging/d").c_str()), 0);
+  ASSERT_EQ(::mkdir(host("/private/var/staging/real").c_str(), 0755), 0);
+  ASSERT_EQ(::symlink("real", host("/private/var/staging/d").c_str()), 0);
+  log.clear();
+  EXPECT_FALSE(Restore());
+  EXPECT_EQ(Lstat(host("/private/var/staging/real")).st_mode & 07777, 0755u);
+  // A root file of the area linked in where mobile's file was recorded: it
+  // is never given to mobile.
+  LayDown();
+  WriteFile(host("/private/var/dbfile"), "secret");
+  ::chmod(host("/private/var/dbfile").c_str(), 0600);
+  ASSERT_EQ(::unlink(host("/private/var/staging/d/m").c_str()), 0);
+  ASSERT_EQ(::link(host("/private/var/dbfile").c_str(), host("/private/var/staging/d/m").c_str()), 0);
+  EXPECT_FALSE(Restore());
+  EXPECT_EQ(Lstat(host("/private/var/dbfile")).st_uid, 0u);
+  // Paths the client sends are client paths.
+  EXPECT_FALSE(ops_.restoreAttributesUnder("/etc", "/private/var/mobile/m.plist", std::nullopt, std::nullopt));
+  EXPECT_FALSE(ops_.restoreAttributesUnder("/private/var/staging", "/private/var/root/m.plist", std::nullopt, std::nullopt));
+}
+
+TEST_F(RestoreTest, AManifestThatFailsItsCheckRestoresNothing) {
+  std::string bytes = ReadFile(host("/private/var/mobile/m.plist"));
+  bytes[bytes.size() / 2] ^= 1;
+  WriteFile(host("/private/var/mobile/m.plist"), bytes);
+  EXPECT_FALSE(Restore());
+  EXPECT_EQ(Lstat(host("/private/var/staging/d/f")).st_uid, kMobile);
+  LogCapture log;
+  EXPECT_FALSE(ops_.restoreAttributesUnder("/private/var/staging", "/private/var/mobile/none.plist", std::nullopt,
+                                           std::nullopt));
+  EXPECT_EQ(log.messages().back(), "Cannot open manifest file.");
 }
 
 }  // namespace

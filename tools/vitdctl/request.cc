@@ -107,6 +107,28 @@ Result<XpcObject> HardLinkParameter(const std::vector<std::string>& args) {
   return XpcObject::Dictionary({{"FilePath", XpcObject::String(args[0])}, {"StagingPath", XpcObject::String(args[1])}});
 }
 
+// STAGING_ROOT MANIFEST [--type TYPE] [--identifier ID]: a missing type or
+// identifier stays out of the request (the whole device).
+Result<XpcObject> RestoreParameter(const std::vector<std::string>& args) {
+  std::vector<std::string> paths;
+  XpcDictionary parameter;
+  for (size_t i = 0; i < args.size(); ++i) {
+    const bool named = args[i] == "--type" || args[i] == "--identifier";
+    if (named && i + 1 == args.size()) return Error::Invalid(args[i] + " needs a value");
+    if (named) {
+      const char* key = args[i] == "--type" ? "ContentType" : "Identifier";
+      parameter.set(key, XpcObject::String(args[i + 1]));
+      ++i;
+    } else {
+      paths.push_back(args[i]);
+    }
+  }
+  if (paths.size() != 2) return Error::Invalid("takes STAGING_ROOT and MANIFEST");
+  parameter.set("StagingRootPath", XpcObject::String(paths[0]));
+  parameter.set("ManifestPath", XpcObject::String(paths[1]));
+  return XpcObject::Dictionary(std::move(parameter));
+}
+
 }  // namespace
 
 XpcObject XpcObjectFromValue(const Value& value) {
@@ -170,6 +192,9 @@ const std::vector<SubCommand>& SubCommands() {
        "write the manifest of PATH (/private/var: the whole device) to the work container", ManifestParameter},
       {"createHardLink", "FILE STAGING_PATH", "hard-link FILE (a directory: its tree) at STAGING_PATH",
        HardLinkParameter},
+      {"restoreAttributes", "STAGING_ROOT MANIFEST [--type TYPE --identifier ID]",
+       "restore the attributes a signed MANIFEST records (of one container, with TYPE and ID) under STAGING_ROOT",
+       RestoreParameter},
       {"moveStagingToFinal", "PATH", "move the staging directory PATH to /var/backup", OnePath},
   };
   return commands;
