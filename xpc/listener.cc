@@ -421,14 +421,14 @@ void Listener::armHousekeeping() {
       next = next ? std::min(*next, *due) : *due;
     }
   }
-  struct itimerspec spec = {};
+  struct itimerspec due = {};
   if (next) {
     const auto wait = std::max<std::chrono::nanoseconds>(*next - std::chrono::steady_clock::now(),
                                                          std::chrono::milliseconds(1));
-    spec.it_value.tv_sec = static_cast<time_t>(wait.count() / 1'000'000'000);
-    spec.it_value.tv_nsec = static_cast<long>(wait.count() % 1'000'000'000);
+    due.it_value.tv_sec = static_cast<time_t>(wait.count() / 1'000'000'000);
+    due.it_value.tv_nsec = static_cast<long>(wait.count() % 1'000'000'000);
   }
-  ::timerfd_settime(housekeepingTimer_.get(), 0, &spec, nullptr);
+  ::timerfd_settime(housekeepingTimer_.get(), 0, &due, nullptr);
 }
 
 void Listener::bufferedChanged(size_t before, size_t after) {
