@@ -10,6 +10,7 @@
 #include "model/record_pipeline.h"
 #include "model/tree_walker.h"
 #include "platform/file_manager.h"
+#include "platform/file_tree.h"
 #include "platform/paths.h"
 #include "platform/termination.h"
 #include "platform/utf8.h"
@@ -287,9 +288,15 @@ std::optional<std::string> VTRManifest::RelativeKey(const std::string& itemPath,
 }
 
 std::vector<std::string> VTRManifest::immediateHiddenFilesUnderPath(const std::string& directory) {
+  UniqueFd dir(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  return dir ? immediateHiddenFilesIn(dir.get(), directory) : std::vector<std::string>();
+}
+
+std::vector<std::string> VTRManifest::immediateHiddenFilesIn(int dirFd, const std::string& directory) {
   std::vector<std::string> hidden;
-  Result<std::vector<std::string>> names = ContentsOfDirectory(directory);
+  Result<std::vector<std::string>> names = DirectoryEntryNames(dirFd, directory);
   if (!names.ok()) return hidden;
+  std::sort(names->begin(), names->end());
   for (const std::string& name : *names) {
     if (HasPrefix(name, ".")) hidden.push_back(AppendPathComponent(directory, name));
   }

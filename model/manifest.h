@@ -141,6 +141,9 @@ class VTRManifest {
   // The full paths of the entries directly in directory whose names begin
   // with "."; empty when it cannot be listed (not logged).
   static std::vector<std::string> immediateHiddenFilesUnderPath(const std::string& directory);
+  // The same for the directory open as dirFd, whose path is directory (the
+  // text the returned paths begin with). dirFd stays the caller's.
+  static std::vector<std::string> immediateHiddenFilesIn(int dirFd, const std::string& directory);
 
   // The summed size of the regular files under treePath not matched by the
   // skip list (the tree path itself never counts). Unwalkable parts are

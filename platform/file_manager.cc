@@ -13,16 +13,8 @@
 
 #include "platform/file_tree.h"
 #include "platform/format.h"
-#include "platform/make_directories.h"
 
 namespace vtr {
-
-bool FileExists(const std::string& path, bool* isDirectory) {
-  struct stat st;
-  const bool exists = ::stat(path.c_str(), &st) == 0;
-  if (isDirectory != nullptr) *isDirectory = exists && S_ISDIR(st.st_mode);
-  return exists;
-}
 
 Status ChangeOwnerOfItem(const std::string& path, uid_t uid, gid_t gid) {
   if (::fchownat(AT_FDCWD, path.c_str(), uid, gid, AT_SYMLINK_NOFOLLOW) != 0) return Error::FromErrno(path);
@@ -30,12 +22,6 @@ Status ChangeOwnerOfItem(const std::string& path, uid_t uid, gid_t gid) {
 }
 
 Status ChangeModeOfItem(const std::string& path, mode_t mode) { return ChangeModeAt(AT_FDCWD, path, mode, path); }
-
-Status CreateDirectory(const std::string& path, bool withIntermediateDirectories) {
-  if (withIntermediateDirectories) return MakeDirectories(path, 0777);
-  if (::mkdir(path.c_str(), 0777) != 0) return Error::FromErrno(path);
-  return Status::Ok();
-}
 
 Result<std::vector<std::string>> ContentsOfDirectory(const std::string& path) {
   UniqueFd fd(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));

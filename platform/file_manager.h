@@ -2,8 +2,7 @@
 // the attribute dictionaries its metadata records and requests are made of.
 //
 // Every operation works on the path it is given without following a
-// symbolic link at the last component (FileExists excepted, which answers
-// the question "is something usable there"). Walks of a tree (MoveItem
+// symbolic link at the last component. Walks of a tree (MoveItem
 // across file systems, LinkItem of a directory, RemoveItem) descend by
 // descriptor with O_NOFOLLOW, so a link planted or swapped in during the walk
 // cannot lead them out of the tree, and they stop at kMaxTreeDepth levels.
@@ -62,11 +61,6 @@ inline constexpr char kNSFileTypeUnknown[] = "NSFileTypeUnknown";  // fifos
 // Deepest directory nesting that MoveItem (across file systems) and LinkItem
 // replicate. Each level holds two descriptors while it is walked.
 inline constexpr int kMaxTreeDepth = 256;
-
-// True when something exists at path, following symbolic links (a dangling
-// link does not count). When isDirectory is given, it is set to whether that
-// something is a directory.
-bool FileExists(const std::string& path, bool* isDirectory = nullptr);
 
 // The attribute dictionary of the item at path itself (one statx, the last
 // component not followed): NSFileType (string, see above), NSFileSize
@@ -132,12 +126,6 @@ Status ChangeOwnerOfItem(const std::string& path, uid_t uid, gid_t gid);
 // the last component fails (Linux gives links no mode of their own, so the
 // kernel answers EOPNOTSUPP).
 Status ChangeModeOfItem(const std::string& path, mode_t mode);
-
-// Creates the directory path with mode 0777 less the umask. Without
-// intermediate directories the parent must exist and an existing item at
-// path fails (EEXIST); with them, missing parents are created too and an
-// existing directory is success.
-Status CreateDirectory(const std::string& path, bool withIntermediateDirectories);
 
 // Moves src to dst, which must not exist (EEXIST otherwise; a dangling link
 // counts as existing). Within one file system this is one rename. Across

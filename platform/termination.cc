@@ -35,6 +35,8 @@ bool TerminationRequested() {
   return requested.load();
 }
 
+bool TerminationRecorded() { return requested.load(std::memory_order_relaxed); }
+
 void RequestTermination() { requested.store(true); }
 
 }  // namespace vtr

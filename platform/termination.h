@@ -22,6 +22,10 @@ void UnwatchTerminationSignal(int signalFd);
 // signalfd (by this call or by the loop) or RequestTermination().
 bool TerminationRequested();
 
+// True once termination was requested, without polling the signalfd: for
+// the loop that reads it itself, after every event.
+bool TerminationRecorded();
+
 // Marks termination requested (the loop does so when it reads SIGTERM).
 void RequestTermination();
 

@@ -9,29 +9,10 @@
 #include "model/manifest.h"
 #include "model/manifest_file.h"
 #include "model/progress_updater.h"
-#include "platform/file_tree.h"
 #include "platform/open_beneath.h"
-#include "platform/paths.h"
 #include "vitd_helper/operations.h"
 
 namespace vtr {
-namespace {
-
-// The full paths (spelled from treePath) of the entries directly in dir
-// whose names begin with "."; none when dir cannot be listed.
-std::vector<std::string> HiddenEntries(int dir, const std::string& treePath) {
-  std::vector<std::string> hidden;
-  Result<std::vector<std::string>> names = DirectoryEntryNames(dir, treePath);
-  if (!names.ok()) return hidden;
-  std::sort(names->begin(), names->end());
-  for (const std::string& name : *names) {
-    if (HasPrefix(name, ".")) hidden.push_back(AppendPathComponent(treePath, name));
-  }
-  return hidden;
-}
-
-}  // namespace
-
 bool VTRHOperations::createDeviceManifest(const std::string& path, bool inclusive) {
   VTRLog("Will create device manifest...");
   // Plain string equality: "/private//var" or "/private/var/mobile" scan as
@@ -60,7 +41,7 @@ bool VTRHOperations::createDeviceManifest(const std::string& path, bool inclusiv
     relativeTo = path;
     if (Result<UniqueFd> tree = OpenEntryNoFollow(location.parent->get(), location.name, O_RDONLY | O_DIRECTORY, path);
         tree.ok()) {
-      skip = HiddenEntries(tree->get(), path);
+      skip = VTRManifest::immediateHiddenFilesIn(tree->get(), path);
     }
   }
   // What the client may not read is never recorded.

@@ -218,7 +218,7 @@ void Listener::run() {
       deliverPendingEvents();
       // A request that ran long may have read SIGTERM itself (and stopped
       // early for it): the loop learns of it here.
-      if (TerminationRequested() && !terminationDelivered_) {
+      if (TerminationRecorded() && !terminationDelivered_) {
         terminationDelivered_ = true;
         deliver(ListenerEvent{ListenerEvent::Kind::kTerminationImminent, nullptr, {}});
         deliverPendingEvents();

@@ -23,7 +23,6 @@ namespace {
 
 using testing::LogCapture;
 using testing::TestPki;
-using testing::ReadFile;
 using testing::TempDir;
 using testing::WriteFile;
 
