@@ -1,5 +1,7 @@
 #include "model/signed_manifest.h"
 
+#include <algorithm>
+
 #include "model/log.h"
 #include "platform/plist.h"
 
@@ -20,72 +22,117 @@ constexpr long kStatusParameter = -50;
 constexpr long kStatusInternal = -2070;
 constexpr long kResultRecoverableFailure = 5;
 
-// A property list read from bytes, or nullopt after the conversion message.
-std::optional<Value> PropertyList(std::span<const uint8_t> bytes, const char* function) {
+// A property-list document of bytes, or null after the conversion message.
+std::unique_ptr<PlistDocument> OpenDocument(std::span<const uint8_t> bytes, const char* function) {
   PlistLimits limits;
   limits.maxInputBytes = std::max<uint64_t>(limits.maxInputBytes, bytes.size());
-  Result<Value> value = ReadPropertyList(bytes, limits);
-  if (!value.ok()) {
-    VTRLog("%s: Cannot convert to property list - %@(0x%x).", function, value.error().description(),
-           static_cast<unsigned>(value.error().code()));
-    return std::nullopt;
+  Result<std::unique_ptr<PlistDocument>> document = PlistDocument::Open(bytes, limits);
+  if (!document.ok()) {
+    VTRLog("%s: Cannot convert to property list - %@(0x%x).", function, document.error().description(),
+           static_cast<unsigned>(document.error().code()));
+    return nullptr;
   }
-  return std::move(*value);
+  return std::move(*document);
+}
+
+// The value of a node that is small by nature (a version, the certificates,
+// the signature); nil for a node too large to build.
+Value Small(const PlistNode& node) {
+  Result<Value> value = node.value();
+  return value.ok() ? std::move(*value) : Value();
 }
 
 }  // namespace
 
-std::optional<VTRSignedManifest> VTRSignedManifest::signedManifestWithBytes(std::span<const uint8_t> bytes,
-                                                                            const SigningAnchors& anchors) {
-  std::optional<Value> outer = PropertyList(bytes, kInit);
-  if (!outer) return std::nullopt;
-  if (outer->dictionary() == nullptr) {
+std::optional<VTRSignedManifest> VTRSignedManifest::signedManifestWithBytes(std::string bytes,
+                                                                            const SigningAnchors& anchors,
+                                                                            SignedManifestFailure* failure) {
+  return Read(std::move(bytes), &anchors, failure);
+}
+
+std::optional<VTRSignedManifest> VTRSignedManifest::unverifiedManifestWithBytes(std::string bytes,
+                                                                                SignedManifestFailure* failure) {
+  return Read(std::move(bytes), nullptr, failure);
+}
+
+std::optional<VTRSignedManifest> VTRSignedManifest::Read(std::string bytes, const SigningAnchors* anchors,
+                                                         SignedManifestFailure* failure) {
+  SignedManifestFailure ignored;
+  if (failure == nullptr) failure = &ignored;
+  *failure = SignedManifestFailure::kMalformed;
+  auto contents = std::make_unique<Contents>();
+  contents->file = std::move(bytes);
+  const std::span<const uint8_t> file(reinterpret_cast<const uint8_t*>(contents->file.data()), contents->file.size());
+  contents->outer = OpenDocument(file, kInit);
+  if (!contents->outer) return std::nullopt;
+  const PlistNode outer = contents->outer->top();
+  if (!outer.isDictionary()) {
     VTRLog("%s: format not correct.", kInit);
     return std::nullopt;
   }
-  const Value version = outer->get("Version");
-  if (version.isNil()) {
+  contents->outerVersion = Small(outer.get("Version"));
+  if (contents->outerVersion.isNil()) {
     VTRLog("%s: required key (version) not found.", kInit);
     return std::nullopt;
   }
-  if (version.intValue() != 2) {
-    VTRLog("%s: signed manifest version %d is not supported yet", kInit, version.intValue());
+  if (contents->outerVersion.intValue() != 2) {
+    VTRLog("%s: signed manifest version %d is not supported yet", kInit, contents->outerVersion.intValue());
+    *failure = SignedManifestFailure::kUnsupportedVersion;
     return std::nullopt;
   }
-  if (!verifyManifestSignature(*outer, anchors)) return std::nullopt;
-  VTRLog("Manifest passed signature check.");
-  const Bytes* payloadBytes = outer->get("Payload").data();
-  if (payloadBytes == nullptr) {
+  if (anchors != nullptr) {
+    if (!verifyManifestSignature(outer, *anchors, failure)) return std::nullopt;
+    *failure = SignedManifestFailure::kMalformed;
+    VTRLog("Manifest passed signature check.");
+  }
+  contents->certificates = Small(outer.get("Certificate"));
+  contents->payloadNode = outer.get("Payload");
+  const std::optional<std::span<const uint8_t>> payloadBytes = contents->payloadNode.data();
+  if (!payloadBytes) {
     // The method name is the only argument; the object prints as (null).
     VTRLog("%s: required key (payload) not found: %@", kInit, nullptr);
     return std::nullopt;
   }
-  std::optional<Value> payload = PropertyList(*payloadBytes, kInit);
-  if (!payload) return std::nullopt;
-  if (payload->dictionary() == nullptr) {
+  contents->payloadBytes = *payloadBytes;
+  if (contents->outer->format() == PlistFormat::kXml) {
+    // The text is no longer needed: its values hold the decoded payload.
+    contents->file = std::string();
+  }
+  contents->payload = OpenDocument(contents->payloadBytes, kInit);
+  if (!contents->payload) return std::nullopt;
+  const PlistNode payload = contents->payload->top();
+  if (!payload.isDictionary()) {
     VTRLog("%s: payload format not correct.", kInit);
     return std::nullopt;
   }
-  const Value payloadVersion = payload->get("Version");
+  const Value payloadVersion = Small(payload.get("Version"));
   if (payloadVersion.isNil()) {
     VTRLog("%s: required key (version) not found.", kInit);
     return std::nullopt;
   }
   if (payloadVersion.intValue() != 3 && payloadVersion.intValue() != 4) {
     VTRLog("%s: raw manifest version %@ is not supported.", kInit, payloadVersion);
+    *failure = SignedManifestFailure::kUnsupportedVersion;
     return std::nullopt;
   }
+  contents->payloadVersion = payloadVersion.intValue();
   for (const char* key : {"Info", "Backup", "App", "AppData"}) {
-    if (payload->get(key).isNil()) {
+    if (payload.get(key).isNil()) {
       VTRLog("%s: required key (Info, App, AppData, or Manifest) not found: %@", kInit, nullptr);
       return std::nullopt;
     }
   }
-  return VTRSignedManifest(std::move(*payload));
+  *failure = SignedManifestFailure::kNone;
+  return VTRSignedManifest(std::move(contents));
 }
 
-std::optional<Bytes> VTRSignedManifest::verifyManifestSignature(const Value& outer, const SigningAnchors& anchors) {
-  const Value certificates = outer.get("Certificate");
+std::optional<std::span<const uint8_t>> VTRSignedManifest::verifyManifestSignature(const PlistNode& outer,
+                                                                                   const SigningAnchors& anchors,
+                                                                                   SignedManifestFailure* failure) {
+  SignedManifestFailure ignored;
+  if (failure == nullptr) failure = &ignored;
+  *failure = SignedManifestFailure::kMalformed;
+  const Value certificates = Small(outer.get("Certificate"));
   if (certificates.array() == nullptr) {
     VTRLog("%s: cannot find certificates, or certificate format not correct.", kVerify);
     return std::nullopt;
@@ -101,15 +148,20 @@ std::optional<Bytes> VTRSignedManifest::verifyManifestSignature(const Value& out
   }
   if (!key) {
     VTRLog("%s: Certificate not valid.", kVerify);
+    *failure = SignedManifestFailure::kNotTrusted;
     return std::nullopt;
   }
-  const Bytes* payload = outer.get("Payload").data();
-  if (payload == nullptr) {
+  const std::optional<std::span<const uint8_t>> payload = outer.get("Payload").data();
+  if (!payload) {
     VTRLog("%s: Manifest format not correct.", kVerify);
     return std::nullopt;
   }
-  if (!verifySignature(outer.get("Signature"), *payload, key.get())) return std::nullopt;
-  return *payload;
+  if (!verifySignature(Small(outer.get("Signature")), *payload, key.get())) {
+    *failure = SignedManifestFailure::kBadSignature;
+    return std::nullopt;
+  }
+  *failure = SignedManifestFailure::kNone;
+  return payload;
 }
 
 PublicKey VTRSignedManifest::createPublicKeyForStrongSigning(const Value& certificates,
@@ -171,7 +223,7 @@ PublicKey VTRSignedManifest::createPublicKey(const Value& certificates, const Tr
   return nullptr;
 }
 
-bool VTRSignedManifest::verifySignature(const Value& signature, const Bytes& data, evp_pkey_st* key) {
+bool VTRSignedManifest::verifySignature(const Value& signature, std::span<const uint8_t> data, evp_pkey_st* key) {
   VTRDebugLog("verifySignature is called");
   const Bytes* bytes = signature.data();
   const bool verified = bytes != nullptr && VerifyRsaSha1Signature(key, *bytes, data);

@@ -10,19 +10,22 @@
 // "Version" 3 or 4 and the keys "Info", "Backup", "App", "AppData", and
 // optionally "GroupData" and "ExtensionData".
 //
-// Every failure is one log line (the messages below are the system's own)
-// and no object. An object is immutable; use it from one thread at a time.
+// Every failure is one log line (the messages are the system's own) and no
+// object. An object is immutable; use it and its nodes from one thread at a
+// time.
 #ifndef VTR_MODEL_SIGNED_MANIFEST_H_
 #define VTR_MODEL_SIGNED_MANIFEST_H_
 
 #include <fcntl.h>
 
 #include <cstdint>
+#include <memory>
 #include <optional>
 #include <span>
 #include <string>
 
 #include "platform/device_properties.h"
+#include "platform/plist_document.h"
 #include "platform/trust_policy.h"
 #include "platform/value.h"
 
@@ -38,17 +41,35 @@ struct SigningAnchors {
   int rootFd = AT_FDCWD;
 };
 
+// Why a signed manifest was not read, for tools that answer by cause.
+enum class SignedManifestFailure {
+  kNone,
+  kMalformed,           // not a property list, or a key missing or of the wrong type
+  kUnsupportedVersion,  // outer or payload version not one this reads
+  kNotTrusted,          // no policy trusts the certificate chain
+  kBadSignature,        // the signature does not sign the payload
+};
+
 class VTRSignedManifest {
  public:
   // The verified manifest of the bytes of a signed manifest file, or nullopt
   // after the message saying why (unreadable, malformed, an unsupported
-  // version, a chain no policy trusts, a bad signature).
-  static std::optional<VTRSignedManifest> signedManifestWithBytes(std::span<const uint8_t> bytes,
-                                                                  const SigningAnchors& anchors = {});
+  // version, a chain no policy trusts, a bad signature), with the cause in
+  // *failure when given. The object keeps the bytes: a binary payload is
+  // read in place, one record at a time, never built whole.
+  static std::optional<VTRSignedManifest> signedManifestWithBytes(std::string bytes,
+                                                                  const SigningAnchors& anchors = {},
+                                                                  SignedManifestFailure* failure = nullptr);
+  // The same reading with the signature left unchecked: for tools that
+  // show a manifest, never for trusting one. The same messages.
+  static std::optional<VTRSignedManifest> unverifiedManifestWithBytes(std::string bytes,
+                                                                      SignedManifestFailure* failure = nullptr);
 
   // The "Payload" bytes of the outer dictionary when its chain is trusted
   // and its signature good; nullopt otherwise.
-  static std::optional<Bytes> verifyManifestSignature(const Value& outer, const SigningAnchors& anchors);
+  static std::optional<std::span<const uint8_t>> verifyManifestSignature(const PlistNode& outer,
+                                                                         const SigningAnchors& anchors,
+                                                                         SignedManifestFailure* failure = nullptr);
 
   // The signer's key when the chain is trusted under the production
   // (strong) or test (development) policy; null otherwise, after a message.
@@ -59,22 +80,45 @@ class VTRSignedManifest {
   static PublicKey createPublicKey(const Value& certificates, const TrustPolicy& policy);
 
   // Whether signature (data, else it has no bytes) signs data with key.
-  static bool verifySignature(const Value& signature, const Bytes& data, evp_pkey_st* key);
+  static bool verifySignature(const Value& signature, std::span<const uint8_t> data, evp_pkey_st* key);
 
-  // The parsed payload and its parts (nil where a key is missing).
-  const Value& payload() const { return payload_; }
-  int32_t getVersion() const { return payload_.get("Version").intValue(); }
-  Value getInfo() const { return payload_.get("Info"); }
-  Value getManifest() const { return payload_.get("Backup"); }
-  Value getAppList() const { return payload_.get("App"); }
-  Value getAppDataList() const { return payload_.get("AppData"); }
-  Value getGroupDataList() const { return payload_.get("GroupData"); }
-  Value getPlugInDataList() const { return payload_.get("ExtensionData"); }
+  // The payload and its parts (nil nodes where a key is missing). Nodes
+  // are valid while this object lives.
+  PlistNode payload() const { return contents_->payload->top(); }
+  int32_t getVersion() const { return contents_->payloadVersion; }
+  PlistNode getInfo() const { return payload().get("Info"); }
+  PlistNode getManifest() const { return payload().get("Backup"); }
+  PlistNode getAppList() const { return payload().get("App"); }
+  PlistNode getAppDataList() const { return payload().get("AppData"); }
+  PlistNode getGroupDataList() const { return payload().get("GroupData"); }
+  PlistNode getPlugInDataList() const { return payload().get("ExtensionData"); }
+
+  // The outer layer, for tools that show it: its version as read, the
+  // certificates (DER data, leaf first), the payload's size and format.
+  const Value& outerVersion() const { return contents_->outerVersion; }
+  const Value& certificates() const { return contents_->certificates; }
+  size_t payloadSize() const { return contents_->payloadBytes.size(); }
+  PlistFormat payloadFormat() const { return contents_->payload->format(); }
 
  private:
-  explicit VTRSignedManifest(Value payload) : payload_(std::move(payload)) {}
+  // Everything a manifest reads from, kept at one address so that nodes
+  // into it stay valid when the object moves.
+  struct Contents {
+    std::string file;
+    std::unique_ptr<PlistDocument> outer;
+    PlistNode payloadNode;  // keeps the payload bytes of an XML file alive
+    std::span<const uint8_t> payloadBytes;
+    std::unique_ptr<PlistDocument> payload;
+    Value outerVersion;
+    Value certificates;
+    int32_t payloadVersion = 0;
+  };
 
-  Value payload_;
+  static std::optional<VTRSignedManifest> Read(std::string bytes, const SigningAnchors* anchors,
+                                               SignedManifestFailure* failure);
+  explicit VTRSignedManifest(std::unique_ptr<Contents> contents) : contents_(std::move(contents)) {}
+
+  std::unique_ptr<Contents> contents_;
 };
 
 }  // namespace vtr

@@ -194,10 +194,21 @@ Status SetAttributesOfDescriptor(const Dictionary& attributes, int fd, const std
   if (!changes.ok()) return changes.error();
   if (changes->empty()) return Status::Ok();
   struct statx stx;
-  if (::statx(fd, "", AT_EMPTY_PATH, STATX_TYPE | STATX_MODE | STATX_NLINK | STATX_UID | STATX_GID, &stx) != 0) {
+  if (::statx(fd, "", AT_EMPTY_PATH, STATX_TYPE | STATX_MODE | STATX_NLINK | STATX_UID | STATX_GID | STATX_MTIME,
+              &stx) != 0) {
     return Error::FromErrno(path);
   }
   if (!S_ISREG(stx.stx_mode) && !S_ISDIR(stx.stx_mode)) return Error(EOPNOTSUPP, path);
+  // What already holds is not set again (a restore over content that is
+  // mostly right costs little). A change of owner clears the set-id bits,
+  // so the mode is set after one whatever it was.
+  if (changes->owner == stx.stx_uid) changes->owner.reset();
+  if (changes->group == stx.stx_gid) changes->group.reset();
+  if (!changes->owner && !changes->group && changes->mode == (stx.stx_mode & 07777)) changes->mode.reset();
+  if (changes->modificationTime && changes->modificationTime->tv_sec == stx.stx_mtime.tv_sec &&
+      changes->modificationTime->tv_nsec == static_cast<long>(stx.stx_mtime.tv_nsec)) {
+    changes->modificationTime.reset();
+  }
   // A file linked elsewhere too would hand over an inode that lives there:
   // it may go to root, never to anyone else.
   const bool handedOver = (changes->owner && *changes->owner != stx.stx_uid && *changes->owner != 0) ||

@@ -44,24 +44,52 @@ std::string JoinPathComponents(const std::vector<std::string>& components, size_
   return path;
 }
 
+namespace {
+
+constexpr int kDirectoryFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
+
+// Opens components[i] in parent, the directory of components[0, i); with
+// create, a missing one is made with mkdirat(mode) first.
+Result<UniqueFd> OpenComponent(int parent, const std::vector<std::string>& components, size_t i, bool create,
+                               mode_t mode) {
+  const char* name = components[i].c_str();
+  UniqueFd next(::openat(parent, name, kDirectoryFlags));
+  if (!next && errno == ENOENT && create) {
+    if (::mkdirat(parent, name, mode) != 0 && errno != EEXIST) {
+      return Error::FromErrno(JoinPathComponents(components, i + 1));
+    }
+    next.reset(::openat(parent, name, kDirectoryFlags));
+  }
+  if (!next) return OpenError(errno, parent, name, JoinPathComponents(components, i + 1));
+  return next;
+}
+
+}  // namespace
+
 Result<UniqueFd> OpenDirectoryBeneath(int rootFd, const std::vector<std::string>& components, size_t count,
                                       bool create, mode_t mode) {
-  constexpr int kFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
-  UniqueFd current(::openat(rootFd, ".", kFlags));
+  UniqueFd current(::openat(rootFd, ".", kDirectoryFlags));
   if (!current) return Error::FromErrno("/");
   for (size_t i = 0; i < count; ++i) {
-    const char* name = components[i].c_str();
-    UniqueFd next(::openat(current.get(), name, kFlags));
-    if (!next && errno == ENOENT && create) {
-      if (::mkdirat(current.get(), name, mode) != 0 && errno != EEXIST) {
-        return Error::FromErrno(JoinPathComponents(components, i + 1));
-      }
-      next.reset(::openat(current.get(), name, kFlags));
-    }
-    if (!next) return OpenError(errno, current.get(), name, JoinPathComponents(components, i + 1));
-    current = std::move(next);
+    Result<UniqueFd> next = OpenComponent(current.get(), components, i, create, mode);
+    if (!next.ok()) return next.error();
+    current = std::move(*next);
   }
   return current;
+}
+
+Result<int> OpenDirectoryChain::open(const std::vector<std::string>& components, size_t count) {
+  size_t shared = 0;
+  while (shared < count && shared < names_.size() && names_[shared] == components[shared]) ++shared;
+  names_.resize(shared);
+  directories_.resize(shared);
+  for (size_t i = shared; i < count; ++i) {
+    Result<UniqueFd> next = OpenComponent(i == 0 ? rootFd_ : directories_[i - 1].get(), components, i, false, 0);
+    if (!next.ok()) return next.error();
+    names_.push_back(components[i]);
+    directories_.push_back(std::move(*next));
+  }
+  return count == 0 ? rootFd_ : directories_[count - 1].get();
 }
 
 Result<UniqueFd> OpenEntryNoFollow(int dirFd, const std::string& name, int flags, const std::string& pathForErrors) {

@@ -38,6 +38,29 @@ std::string JoinPathComponents(const std::vector<std::string>& components, size_
 Result<UniqueFd> OpenDirectoryBeneath(int rootFd, const std::vector<std::string>& components, size_t count,
                                       bool create = false, mode_t mode = 0755);
 
+// The directories along one path beneath a root, kept open so that the next
+// path sharing a prefix with it opens only the components that differ: for
+// going through many paths in tree order (a manifest's records), where each
+// path would otherwise cost one open per component. Directories are opened
+// as OpenDirectoryBeneath opens them, each relative to the one before. One
+// renamed elsewhere after it was opened is still the one used below it; it
+// was beneath the root when it was reached. Not thread-safe.
+class OpenDirectoryChain {
+ public:
+  // rootFd stays the caller's and must outlive the chain.
+  explicit OpenDirectoryChain(int rootFd) : rootFd_(rootFd) {}
+
+  // The directory reached through components[0, count) (rootFd itself when
+  // count is 0), with OpenDirectoryBeneath's errors. Valid until the next
+  // call.
+  Result<int> open(const std::vector<std::string>& components, size_t count);
+
+ private:
+  int rootFd_;
+  std::vector<std::string> names_;
+  std::vector<UniqueFd> directories_;  // directories_[i]: the directory of names_[0, i]
+};
+
 // Opens the entry name of dirFd with flags | O_NOFOLLOW | O_CLOEXEC, adding
 // O_NONBLOCK so that a fifo planted there cannot block the helper. A link
 // gives ELOOP. pathForErrors names the entry in the error.

@@ -1,13 +1,4 @@
-// The binary property-list reader.
-//
-// The input is hostile until proven otherwise. Before any object is decoded
-// the trailer and every offset, count and reference are checked against the
-// file, and references are counted so that only objects reached more than
-// once are remembered. Objects are then decoded without recursion (an
-// explicit stack bounded by the depth limit), containers are refused when
-// they contain themselves, and the size of the result is tracked as if every
-// shared object were copied wherever it is referenced, so a small file cannot
-// describe a huge result.
+// The binary property-list reader (see plist_binary_reader.h).
 #include <algorithm>
 #include <cstring>
 #include <optional>
@@ -16,12 +7,10 @@
 
 #include "platform/format.h"
 #include "platform/plist.h"
-#include "platform/plist_binary_format.h"
+#include "platform/plist_binary_reader.h"
 
-namespace vtr {
+namespace vtr::bplist {
 namespace {
-
-using namespace bplist;
 
 // Derived bounds when the caller leaves them at 0: a multiple of the input
 // size, never below a floor that every small honest file stays far under.
@@ -33,94 +22,44 @@ constexpr uint64_t kExpansionFactor = 16;
 // at 2, all that matters) and whether it is being decoded right now.
 constexpr uint8_t kReferenceCountMask = 0x03;
 constexpr uint8_t kOnPath = 0x80;
+constexpr uint8_t kValidated = 0x40;
 
 // Dictionaries and arrays reserve at most this many slots up front; a file
 // cannot make every level of a deep stack reserve its claimed count.
 constexpr uint64_t kMaxReserve = 256;
+
+// Shared scalars remembered from one decode call to the next.
+constexpr size_t kMaxScalarsRemembered = 4096;
 
 uint64_t SaturatingAdd(uint64_t a, uint64_t b) { return a > UINT64_MAX - b ? UINT64_MAX : a + b; }
 uint64_t SaturatingMultiply(uint64_t a, uint64_t b) { return b != 0 && a > UINT64_MAX / b ? UINT64_MAX : a * b; }
 
 Error Invalid(const std::string& what) { return Error::Invalid("binary property list: " + what); }
 
-// Where an object lives and what its marker says, checked against the file.
-struct ObjectHeader {
-  uint64_t index = 0;
-  uint64_t offset = 0;
-  uint8_t marker = 0;
-  uint64_t count = 0;    // elements (strings: bytes or UTF-16 units; containers: entries)
-  uint64_t content = 0;  // offset of the first byte after the marker and count
-  uint8_t type() const { return marker >> 4; }
-  bool isContainer() const { return type() == kArrayType || type() == kDictType; }
-};
+}  // namespace
 
-// A shared object decoded once, with the expanded size of one copy of it.
-struct Memo {
-  Value value;
-  uint64_t nodes = 0;
-  uint64_t bytes = 0;
-};
+BinaryPlistReader::BinaryPlistReader(std::span<const uint8_t> bytes, const PlistLimits& limits)
+    : bytes_(bytes), limits_(limits) {
+  const uint64_t size = bytes.size();
+  maxNodes_ = limits.maxExpandedNodes ? limits.maxExpandedNodes
+                                      : std::max(kNodeFloor, SaturatingMultiply(kExpansionFactor, size));
+  maxBytes_ = limits.maxExpandedBytes ? limits.maxExpandedBytes
+                                      : std::max(kByteFloor, SaturatingMultiply(kExpansionFactor, size));
+}
 
-// An array or dictionary being decoded.
-struct Frame {
-  ObjectHeader header;
-  uint64_t next = 0;  // index of the next element to decode
-  Array items;
-  DictionaryBuilder entries;
-  std::string key;  // key of the dictionary value being decoded
-  uint64_t nodesBefore = 0;
-  uint64_t bytesBefore = 0;
-};
+Status BinaryPlistReader::open() {
+  if (Status s = readTrailer(); !s.ok()) return s;
+  return checkObjects();
+}
 
-class BinaryPlistReader {
- public:
-  BinaryPlistReader(std::span<const uint8_t> bytes, const PlistLimits& limits) : bytes_(bytes), limits_(limits) {
-    const uint64_t size = bytes.size();
-    maxNodes_ = limits.maxExpandedNodes ? limits.maxExpandedNodes
-                                        : std::max(kNodeFloor, SaturatingMultiply(kExpansionFactor, size));
-    maxBytes_ = limits.maxExpandedBytes ? limits.maxExpandedBytes
-                                        : std::max(kByteFloor, SaturatingMultiply(kExpansionFactor, size));
-  }
+Error BinaryPlistReader::objectError(uint64_t index, const std::string& what) const {
+  return Invalid(Format("object %llu: %@", static_cast<unsigned long long>(index), what));
+}
 
-  Result<Value> read() {
-    if (Status s = readTrailer(); !s.ok()) return s.error();
-    if (Status s = checkObjects(); !s.ok()) return s.error();
-    return decode();
-  }
-
- private:
-  Status readTrailer();
-  Status checkObjects();
-  Result<ObjectHeader> header(uint64_t index) const;
-  Result<Value> decode();
-  Result<std::optional<Value>> reach(uint64_t index);
-  Result<Value> decodeScalar(const ObjectHeader& h) const;
-  Result<std::string> decodeKey(uint64_t index);
-  Result<Value> finish(Frame& frame);
-  Status charge(uint64_t nodes, uint64_t bytes, uint64_t index);
-
-  uint64_t reference(const ObjectHeader& h, uint64_t slot) const {
-    return ReadBigEndian(&bytes_[h.content + slot * trailer_.objectRefSize], trailer_.objectRefSize);
-  }
-  Error objectError(uint64_t index, const std::string& what) const {
-    return Invalid(Format("object %llu: %@", static_cast<unsigned long long>(index), what));
-  }
-  Error objectError(const ObjectHeader& h, const std::string& what) const {
-    return Invalid(Format("object %llu at offset %llu: %@", static_cast<unsigned long long>(h.index),
-                          static_cast<unsigned long long>(h.offset), what));
-  }
-
-  std::span<const uint8_t> bytes_;
-  PlistLimits limits_;
-  uint64_t maxNodes_;
-  uint64_t maxBytes_;
-  Trailer trailer_;
-  std::vector<uint8_t> state_;  // per object: reference count and kOnPath
-  std::unordered_map<uint64_t, Memo> memo_;
-  std::vector<Frame> stack_;
-  uint64_t nodes_ = 0;
-  uint64_t expandedBytes_ = 0;
-};
+Error BinaryPlistReader::objectError(const ObjectHeader& h, const std::string& what) const {
+  return Invalid(Format("object %llu at offset %llu: %@", static_cast<unsigned long long>(h.index),
+                        static_cast<unsigned long long>(h.offset), what));
+}
 
 Status BinaryPlistReader::readTrailer() {
   const uint64_t size = bytes_.size();
@@ -295,19 +234,28 @@ Result<Value> BinaryPlistReader::decodeScalar(const ObjectHeader& h) const {
     case kDataType:
       return Value::Data(p, h.count);
     case kAsciiType:
-      for (uint64_t i = 0; i < h.count; ++i) {
-        if (p[i] >= 0x80) return objectError(h, "non-ASCII byte in an ASCII string");
-      }
-      return Value::String(std::string(reinterpret_cast<const char*>(p), h.count));
     case kUtf16Type: {
-      std::string text;
-      text.reserve(h.count);
-      if (!AppendUtf8FromUtf16BigEndian({p, 2 * h.count}, &text)) return objectError(h, "invalid UTF-16 string");
-      return Value::String(std::move(text));
+      Result<std::string> text = decodeText(h);
+      if (!text.ok()) return text.error();
+      return Value::String(std::move(*text));
     }
     default:
       return objectError(h, "unexpected object type");
   }
+}
+
+Result<std::string> BinaryPlistReader::decodeText(const ObjectHeader& h) const {
+  std::string scratch;
+  Result<std::string_view> text = textView(h, &scratch);
+  if (!text.ok()) return text.error();
+  if (text->data() == scratch.data()) return scratch;
+  return std::string(*text);
+}
+
+Result<std::string> BinaryPlistReader::keyText(uint64_t index) const {
+  Result<ObjectHeader> h = header(index);
+  if (!h.ok()) return h.error();
+  return decodeText(*h);
 }
 
 // Decodes object index where it is referenced: its value when it is a scalar
@@ -351,12 +299,15 @@ Result<std::optional<Value>> BinaryPlistReader::reach(uint64_t index) {
 }
 
 Result<std::string> BinaryPlistReader::decodeKey(uint64_t index) {
-  Result<std::optional<Value>> key = reach(index);
-  if (!key.ok()) return key.error();
-  // Only containers leave no value, and they are not strings either.
-  const std::string* text = *key ? (*key)->string() : nullptr;
-  if (!text) return objectError(index, "dictionary key is not a string");
-  return *text;
+  // Keys are decoded where they stand, never remembered: a Value shared by
+  // every record would be copied (and counted) once per record.
+  Result<ObjectHeader> h = header(index);
+  if (!h.ok()) return h.error();
+  if (h->type() != kAsciiType && h->type() != kUtf16Type) return objectError(index, "dictionary key is not a string");
+  Result<std::string> text = decodeText(*h);
+  if (!text.ok()) return text.error();
+  if (Status s = charge(1, text->size(), index); !s.ok()) return s.error();
+  return text;
 }
 
 // The value of a container whose elements are all decoded; remembers it when
@@ -374,12 +325,29 @@ Result<Value> BinaryPlistReader::finish(Frame& frame) {
   state_[index] &= ~kOnPath;
   if ((state_[index] & kReferenceCountMask) > 1) {
     memo_[index] = Memo{value, nodes_ - frame.nodesBefore, expandedBytes_ - frame.bytesBefore};
+    containersRemembered_.push_back(index);
   }
   return value;
 }
 
-Result<Value> BinaryPlistReader::decode() {
-  Result<std::optional<Value>> top = reach(trailer_.topObject);
+Result<Value> BinaryPlistReader::decode(uint64_t index) {
+  nodes_ = 0;
+  expandedBytes_ = 0;
+  Result<Value> value = decodeFromTop(index);
+  // A failed decode leaves its open containers marked; the next call starts
+  // clean. Shared containers are remembered for one call only; shared
+  // scalars (the keys and common numbers of every record) for the next
+  // calls too, up to a bound.
+  for (const Frame& frame : stack_) state_[frame.header.index] &= ~kOnPath;
+  stack_.clear();
+  for (uint64_t container : containersRemembered_) memo_.erase(container);
+  containersRemembered_.clear();
+  if (memo_.size() > kMaxScalarsRemembered) memo_.clear();
+  return value;
+}
+
+Result<Value> BinaryPlistReader::decodeFromTop(uint64_t index) {
+  Result<std::optional<Value>> top = reach(index);
   if (!top.ok()) return top.error();
   if (*top) return std::move(**top);
   while (true) {
@@ -413,10 +381,103 @@ Result<Value> BinaryPlistReader::decode() {
   }
 }
 
-}  // namespace
+Result<std::string_view> BinaryPlistReader::textView(const ObjectHeader& h, std::string* scratch) const {
+  const uint8_t* p = &bytes_[h.content];
+  if (h.type() == kAsciiType) {
+    for (uint64_t i = 0; i < h.count; ++i) {
+      if (p[i] >= 0x80) return objectError(h, "non-ASCII byte in an ASCII string");
+    }
+    return std::string_view(reinterpret_cast<const char*>(p), h.count);
+  }
+  if (h.type() != kUtf16Type) return objectError(h, "dictionary key is not a string");
+  scratch->clear();
+  if (!AppendUtf8FromUtf16BigEndian({p, 2 * h.count}, scratch)) return objectError(h, "invalid UTF-16 string");
+  return std::string_view(*scratch);
+}
+
+Status BinaryPlistReader::checkUniqueKeys(const ObjectHeader& dict, std::vector<std::pair<size_t, uint64_t>>& keys) const {
+  // Keys are told apart by a hash of their text; only keys whose hashes meet
+  // are compared whole. ASCII keys, nearly all of them, are hashed in place.
+  keys.clear();
+  std::string scratch;
+  for (uint64_t slot = 0; slot < dict.count; ++slot) {
+    const uint64_t index = reference(dict, slot);
+    Result<ObjectHeader> h = header(index);
+    if (!h.ok()) return h.error();
+    Result<std::string_view> text = textView(*h, &scratch);
+    if (!text.ok()) return text.error();
+    keys.emplace_back(std::hash<std::string_view>{}(*text), index);
+  }
+  std::sort(keys.begin(), keys.end());
+  for (size_t i = 1; i < keys.size(); ++i) {
+    if (keys[i].first != keys[i - 1].first) continue;
+    if (keys[i].second == keys[i - 1].second || *keyText(keys[i].second) == *keyText(keys[i - 1].second)) {
+      return objectError(dict, "duplicate dictionary key");
+    }
+  }
+  return Status::Ok();
+}
+
+Status BinaryPlistReader::validate() {
+  struct Visit {
+    ObjectHeader header;
+    uint64_t next = 0;
+  };
+  std::vector<Visit> path;
+  std::vector<std::pair<size_t, uint64_t>> keys;  // scratch of checkUniqueKeys
+  std::string text;                                // scratch of textView
+  // Checks a scalar at once; puts a container on the path.
+  auto enter = [&](uint64_t index) -> Status {
+    uint8_t& state = state_[index];
+    if (state & kOnPath) return objectError(index, "contains itself");
+    if (state & kValidated) return Status::Ok();
+    Result<ObjectHeader> h = header(index);
+    if (!h.ok()) return h.error();
+    if (!h->isContainer()) {
+      // Data is whole once its header is; text is checked in place;
+      // everything else must decode.
+      if (h->type() == kAsciiType || h->type() == kUtf16Type) {
+        if (Result<std::string_view> checked = textView(*h, &text); !checked.ok()) return checked.error();
+      } else if (h->type() != kDataType) {
+        if (Result<Value> value = decodeScalar(*h); !value.ok()) return value.error();
+      }
+      state |= kValidated;
+      return Status::Ok();
+    }
+    if (path.size() >= limits_.maxDepth) {
+      return objectError(*h, Format("nested deeper than %u levels", limits_.maxDepth));
+    }
+    if (h->type() == kDictType) {
+      if (Status unique = checkUniqueKeys(*h, keys); !unique.ok()) return unique;
+    }
+    state |= kOnPath;
+    path.push_back(Visit{*h});
+    return Status::Ok();
+  };
+  Status status = enter(trailer_.topObject);
+  while (status.ok() && !path.empty()) {
+    Visit& visit = path.back();
+    const uint64_t slot = visit.next++;
+    if (slot == visit.header.count) {
+      state_[visit.header.index] = (state_[visit.header.index] & ~kOnPath) | kValidated;
+      path.pop_back();
+      continue;
+    }
+    const bool dict = visit.header.type() == kDictType;
+    status = enter(reference(visit.header, dict ? slot + visit.header.count : slot));
+  }
+  for (const Visit& visit : path) state_[visit.header.index] &= ~kOnPath;
+  return status;
+}
+
+}  // namespace vtr::bplist
+
+namespace vtr {
 
 Result<Value> ReadBinaryPropertyList(std::span<const uint8_t> bytes, const PlistLimits& limits) {
-  return BinaryPlistReader(bytes, limits).read();
+  bplist::BinaryPlistReader reader(bytes, limits);
+  if (Status s = reader.open(); !s.ok()) return s.error();
+  return reader.decode(reader.top());
 }
 
 }  // namespace vtr

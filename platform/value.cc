@@ -35,6 +35,10 @@ bool NumbersEqual(const Value& a, const Value& b) {
 }  // namespace
 
 Dictionary::Dictionary(std::vector<Entry> entries) : entries_(std::move(entries)) {
+  // Entries mostly arrive sorted and unique (copied from another dictionary,
+  // read from a file written sorted): nothing to do then.
+  const auto outOfOrder = [](const Entry& a, const Entry& b) { return !(a.first < b.first); };
+  if (std::adjacent_find(entries_.begin(), entries_.end(), outOfOrder) == entries_.end()) return;
   std::stable_sort(entries_.begin(), entries_.end(), KeyLess);
   // Keep the last of each run of equal keys.
   std::vector<Entry> unique;
@@ -63,7 +67,10 @@ void DictionaryBuilder::add(std::string key, Value value) { entries_.emplace_bac
 Value DictionaryBuilder::build() { return Value::DictionaryOf(Dictionary(std::move(entries_))); }
 
 std::optional<Value> DictionaryBuilder::buildUnique() {
-  std::stable_sort(entries_.begin(), entries_.end(), KeyLess);
+  // Files written by careful writers hold their keys sorted already.
+  if (!std::is_sorted(entries_.begin(), entries_.end(), KeyLess)) {
+    std::stable_sort(entries_.begin(), entries_.end(), KeyLess);
+  }
   for (size_t i = 1; i < entries_.size(); ++i) {
     if (entries_[i - 1].first == entries_[i].first) return std::nullopt;
   }

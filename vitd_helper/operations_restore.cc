@@ -3,13 +3,14 @@
 #include <fcntl.h>
 #include <sys/stat.h>
 
-#include "model/file_metadata.h"
+#include <thread>
+
 #include "model/log.h"
 #include "model/signed_manifest.h"
 #include "platform/open_beneath.h"
-#include "platform/paths.h"
 #include "platform/read_fully.h"
 #include "vitd_helper/operations.h"
+#include "vitd_helper/restore_workers.h"
 
 namespace vtr {
 namespace {
@@ -19,15 +20,15 @@ constexpr size_t kMaxSignedManifestBytes = size_t{512} << 20;
 
 // The file manifest the container type and identifier select, or nullopt
 // after the message saying why not.
-std::optional<Value> ChooseManifest(const VTRSignedManifest& signedManifest,
-                                    const std::optional<std::string>& containerType,
-                                    const std::optional<std::string>& identifier) {
+std::optional<PlistNode> ChooseManifest(const VTRSignedManifest& signedManifest,
+                                        const std::optional<std::string>& containerType,
+                                        const std::optional<std::string>& identifier) {
   if (!containerType || !identifier) return signedManifest.getManifest();
   const std::string& type = *containerType;
   const std::string& id = *identifier;
-  Value chosen;
+  PlistNode chosen;
   if (type == "AppData") {
-    const Value container = signedManifest.getAppDataList().get(id);
+    const PlistNode container = signedManifest.getAppDataList().get(id);
     if (container.isNil()) {
       VTRLog("Couldn't load container data for %@/%@", type, id);
       return std::nullopt;
@@ -66,19 +67,19 @@ bool VTRHOperations::restoreAttributesUnder(const std::string& root, const std::
     return false;
   }
   SigningAnchors anchors{paths_.productionAnchors, paths_.testAnchors, paths_.efiVariables, resolver_.root()};
-  const std::span<const uint8_t> content(reinterpret_cast<const uint8_t*>(bytes->data()), bytes->size());
-  std::optional<VTRSignedManifest> signedManifest = VTRSignedManifest::signedManifestWithBytes(content, anchors);
-  bytes = std::string();
+  // The manifest keeps the bytes and reads its records from them one at a
+  // time: a whole device's manifest is never built in memory.
+  std::optional<VTRSignedManifest> signedManifest =
+      VTRSignedManifest::signedManifestWithBytes(std::move(*bytes), anchors);
   if (!signedManifest) return false;
 
-  std::optional<Value> chosen = ChooseManifest(*signedManifest, containerType, identifier);
+  std::optional<PlistNode> chosen = ChooseManifest(*signedManifest, containerType, identifier);
   if (!chosen) return false;
-  const Dictionary* records = chosen->dictionary();
-  if (records == nullptr) {
+  if (!chosen->isDictionary()) {
     VTRLog("Couldn't get manifest.");
     return false;
   }
-  if (records->empty()) return true;  // nothing to restore touches nothing
+  if (chosen->count() == 0) return true;  // nothing to restore touches nothing
 
   // The staging root is a client path; it is changed with all below it.
   std::optional<CheckedPath> staging = checkClientPath(root, ClientUse::kChange);
@@ -88,24 +89,16 @@ bool VTRHOperations::restoreAttributesUnder(const std::string& root, const std::
     LogRefusal(root, stagingDir.error());
     return false;
   }
-  for (const auto& [key, value] : *records) {
-    if (value.dictionary() == nullptr) return false;
-    const VTRFileMetadata record(value);
-    const std::string target = AppendPathComponent(root, key);
-    // The record's own path, beneath the staging root: no "..", no link on
-    // the way; "/" is the root itself.
-    Result<std::vector<std::string>> components = SplitPathComponents("/" + key);
-    Result<UniqueFd> parent = components.ok() ? OpenDirectoryBeneath(stagingDir->get(), *components,
-                                                                     components->empty() ? 0 : components->size() - 1)
-                                              : Result<UniqueFd>(components.error());
-    if (!parent.ok()) {
-      LogRefusal(target, parent.error());
-      return false;
-    }
-    const std::string name = components->empty() ? "." : components->back();
-    if (!record.restoreAttribuesToItemAt(parent->get(), name, target)) return false;
-  }
-  return true;
+  // Records are built here one at a time, in the order the manifest keeps
+  // them, and laid down by workers on every core.
+  RestoreWorkers workers(stagingDir->get(), root, std::thread::hardware_concurrency());
+  bool built = true;
+  chosen->forEachEntry([&](const std::string& key, const PlistNode& node) {
+    Result<Value> record = node.value();
+    built = record.ok();
+    return built && workers.add(key, std::move(*record));
+  });
+  return workers.finish() && built;
 }
 
 }  // namespace vtr

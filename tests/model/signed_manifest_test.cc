@@ -34,6 +34,10 @@ class SignedManifestTest : public ::testing::Test {
     anchors_.efiVariables = efi_.path();
   }
 
+  std::optional<VTRSignedManifest> Read(const Bytes& file) const {
+    return VTRSignedManifest::signedManifestWithBytes(std::string(file.begin(), file.end()), anchors_);
+  }
+
   static std::string Pki(const std::string& name) { return TestPki::Get().file(name); }
 
   static Value Payload(Value version = Value::Integer(3)) {
@@ -68,18 +72,27 @@ class SignedManifestTest : public ::testing::Test {
   SigningAnchors anchors_;
 };
 
-TEST_F(SignedManifestTest, AProductionSignedManifestIsReadWithItsParts) {
-  LogCapture log;
-  std::optional<VTRSignedManifest> manifest =
-      VTRSignedManifest::signedManifestWithBytes(ProductionSigned(Payload()), anchors_);
-  ASSERT_TRUE(manifest.has_value()) << ::testing::PrintToString(log.messages());
-  EXPECT_EQ(manifest->getVersion(), 3);
-  EXPECT_EQ(manifest->getInfo(), Value::String("demo"));
-  EXPECT_TRUE(manifest->getManifest().get("/").dictionary());
-  EXPECT_TRUE(manifest->getAppDataList().get("com.example.app").get("Manifest").dictionary());
-  EXPECT_TRUE(manifest->getGroupDataList().isNil());
-  EXPECT_TRUE(manifest->getPlugInDataList().isNil());
-  EXPECT_EQ(log.messages(), (std::vector<std::string>{"Verifing strong signing", "Manifest passed signature check."}));
+TEST_F(SignedManifestTest, AProductionSignedManifestIsReadWithItsPartsInEitherFormat) {
+  for (const PlistFormat outer : {PlistFormat::kBinary, PlistFormat::kXml}) {
+    for (const PlistFormat inner : {PlistFormat::kBinary, PlistFormat::kXml}) {
+      SCOPED_TRACE(::testing::Message() << "outer " << static_cast<int>(outer) << " inner " << static_cast<int>(inner));
+      LogCapture log;
+      std::optional<VTRSignedManifest> manifest = Read(pki_.productionSigned(Payload(), outer, inner));
+      ASSERT_TRUE(manifest.has_value()) << ::testing::PrintToString(log.messages());
+      // Moved, its nodes still read (they point into what it keeps).
+      const VTRSignedManifest moved = std::move(*manifest);
+      EXPECT_EQ(moved.getVersion(), 3);
+      EXPECT_EQ(*moved.getInfo().value(), Value::String("demo"));
+      EXPECT_EQ(*moved.getManifest().get("/").value(), *Payload().get("Backup").dictionary()->find("/"));
+      EXPECT_TRUE(moved.getAppDataList().get("com.example.app").get("Manifest").isDictionary());
+      EXPECT_TRUE(moved.getGroupDataList().isNil());
+      EXPECT_TRUE(moved.getPlugInDataList().isNil());
+      EXPECT_EQ(moved.payloadFormat(), inner);
+      EXPECT_EQ(moved.certificates().array()->size(), 2u);
+      EXPECT_EQ(log.messages(),
+                (std::vector<std::string>{"Verifing strong signing", "Manifest passed signature check."}));
+    }
+  }
 }
 
 TEST_F(SignedManifestTest, VersionsAndRequiredKeysAreCheckedWithTheirMessages) {
@@ -116,7 +129,7 @@ TEST_F(SignedManifestTest, VersionsAndRequiredKeysAreCheckedWithTheirMessages) {
   };
   for (const auto& c : cases) {
     LogCapture log;
-    const bool read = VTRSignedManifest::signedManifestWithBytes(c.file, anchors_).has_value();
+    const bool read = Read(c.file).has_value();
     EXPECT_EQ(read, c.lastMessage == nullptr && std::string(c.name) != "not a property list") << c.name;
     if (c.lastMessage != nullptr) {
       ASSERT_FALSE(log.messages().empty()) << c.name;
@@ -124,7 +137,7 @@ TEST_F(SignedManifestTest, VersionsAndRequiredKeysAreCheckedWithTheirMessages) {
     }
   }
   LogCapture log;
-  EXPECT_FALSE(VTRSignedManifest::signedManifestWithBytes(Bytes{'n', 'o', 'p', 'e'}, anchors_));
+  EXPECT_FALSE(Read(Bytes{'n', 'o', 'p', 'e'}));
   ASSERT_EQ(log.messages().size(), 1u);
   EXPECT_EQ(log.messages()[0].rfind(init + "Cannot convert to property list - ", 0), 0u) << log.messages()[0];
 }
@@ -152,7 +165,7 @@ TEST_F(SignedManifestTest, TheChainMustBeTrustedAndTheSignatureGood) {
   };
   for (const auto& c : cases) {
     LogCapture log;
-    EXPECT_FALSE(VTRSignedManifest::signedManifestWithBytes(c.file, anchors_).has_value()) << c.name;
+    EXPECT_FALSE(Read(c.file).has_value()) << c.name;
     EXPECT_EQ(log.messages(), c.messages) << c.name;
   }
 
@@ -165,7 +178,7 @@ TEST_F(SignedManifestTest, TheChainMustBeTrustedAndTheSignatureGood) {
     builder.add(k, k == "Certificate" ? Value::ArrayOf({Value::Data({0x30, 0x03, 1, 2})}) : v);
   }
   LogCapture log;
-  EXPECT_FALSE(VTRSignedManifest::signedManifestWithBytes(*EncodeBinaryPropertyList(builder.build()), anchors_));
+  EXPECT_FALSE(Read(*EncodeBinaryPropertyList(builder.build())));
   EXPECT_TRUE(log.contains("__49-[VTRSignedManifest createPublicKey:usingPolicy:]_block_invoke: Cannot load certificate."));
 }
 
@@ -174,7 +187,7 @@ TEST_F(SignedManifestTest, DevelopmentSigningOnlyOnHardwareThatSaysItIsNotFused)
   for (const auto& [fuse, accepted] : {std::pair{1, false}, std::pair{-1, false}, std::pair{0, true}}) {
     SetFuse(fuse);
     LogCapture log;
-    EXPECT_EQ(VTRSignedManifest::signedManifestWithBytes(testSigned, anchors_).has_value(), accepted) << fuse;
+    EXPECT_EQ(Read(testSigned).has_value(), accepted) << fuse;
     EXPECT_EQ(log.contains("Verifing development signing"), fuse == 0) << fuse;
   }
   // A truncated variable is no answer.
@@ -183,7 +196,7 @@ TEST_F(SignedManifestTest, DevelopmentSigningOnlyOnHardwareThatSaysItIsNotFused)
   // Without anchors a policy cannot be created.
   anchors_.production = Pki("missing");
   LogCapture log;
-  EXPECT_FALSE(VTRSignedManifest::signedManifestWithBytes(ProductionSigned(Payload()), anchors_));
+  EXPECT_FALSE(Read(ProductionSigned(Payload())));
   EXPECT_TRUE(log.contains("-[VTRSignedManifest createPublicKeyForStrongSigning:]: Cannot create policy."));
 }
 
@@ -217,8 +230,7 @@ TEST_F(SignedManifestTest, AnExpiredSignerIsNotTrusted) {
   EVP_PKEY_free(caKey);
 
   LogCapture log;
-  EXPECT_FALSE(VTRSignedManifest::signedManifestWithBytes(
-      Signed(Payload(), {Pki("expired.der"), Pki("intermediate.der")}, Pki("intermediate.key")), anchors_));
+  EXPECT_FALSE(Read(Signed(Payload(), {Pki("expired.der"), Pki("intermediate.der")}, Pki("intermediate.key"))));
   EXPECT_TRUE(log.contains("-[VTRSignedManifest createPublicKey:usingPolicy:]: certificate trust evaluation failed: 5"));
 }
 

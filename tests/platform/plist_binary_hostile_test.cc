@@ -8,6 +8,7 @@
 #include <vector>
 
 #include "platform/plist.h"
+#include "platform/plist_document.h"
 #include "tests/platform/strict_value.h"
 
 namespace vtr {
@@ -116,6 +117,79 @@ TEST(BinaryPlistHostileTest, MalformedFilesFailWithWhatAndWhere) {
       {Assemble({{0xA1, 0x01}, {0xD1, 0x02, 0x00}, {0x51, 'k'}}), p + "object 0: contains itself"},
   };
   for (const auto& c : cases) EXPECT_EQ(ErrorOf(c.file), c.error);
+}
+
+// The document reader checks all of a file when it opens it, so that what
+// it hands out later cannot fail: it refuses deep inside what the whole-file
+// reader refuses, and reads the same value from what that reader accepts.
+TEST(BinaryPlistHostileTest, TheDocumentReaderRefusesWhatTheReaderRefuses) {
+  // {"a": object 2}, with object 2 varied; 3 is "k", 4 the integer 1.
+  const auto file = [](Bytes inner, std::vector<Bytes> more = {}) {
+    std::vector<Bytes> objects = {{0xD1, 1, 2}, {0x51, 'a'}, std::move(inner), {0x51, 'k'}, {0x10, 1}};
+    for (Bytes& object : more) objects.push_back(std::move(object));
+    return Assemble(objects);
+  };
+  const struct {
+    const char* name;
+    Bytes file;
+    bool accepted;
+  } cases[] = {
+      {"two keys", file({0xD2, 3, 5, 4, 4}, {{0x51, 'j'}}), true},
+      {"a UTF-16 key", file({0xD2, 3, 5, 4, 4}, {{0x61, 0, 'j'}}), true},
+      {"one key object twice", file({0xD2, 3, 3, 4, 4}), false},
+      {"the same text in ASCII and UTF-16", file({0xD2, 3, 5, 4, 4}, {{0x61, 0, 'k'}}), false},
+      {"a number as key", file({0xD1, 4, 4}), false},
+      {"an array holding itself", file({0xA1, 2}), false},
+      {"a byte past ASCII", file({0xD1, 3, 5}, {{0x51, 0xC3}}), false},
+      {"an unpaired surrogate", file({0xD1, 3, 5}, {{0x61, 0xD8, 0x00}}), false},
+  };
+  for (const auto& c : cases) {
+    Result<Value> whole = ReadBinaryPropertyList(c.file);
+    Result<std::unique_ptr<PlistDocument>> document = PlistDocument::Open(c.file);
+    EXPECT_EQ(whole.ok(), c.accepted) << c.name;
+    ASSERT_EQ(document.ok(), c.accepted) << c.name << ": " << (document.ok() ? "" : document.error().message());
+    if (!c.accepted) continue;
+    const PlistNode top = (*document)->top();
+    EXPECT_TRUE(StrictlyEqual(*top.value(), *whole)) << c.name;
+    ASSERT_EQ(top.count(), 1u);
+    EXPECT_EQ(top.keyAt(0), "a");
+    EXPECT_EQ(top.get("a").count(), 2u);
+    EXPECT_TRUE(StrictlyEqual(*top.get("a").get("k").value(), Value::Integer(1))) << c.name;
+    EXPECT_TRUE(top.get("b").isNil());
+  }
+}
+
+// A document hands out what it holds without building the rest: data in
+// place, and in either format the same entries in the same order.
+TEST(BinaryPlistHostileTest, DocumentNodesInEitherFormat) {
+  const Value value = Value::DictionaryOf({{"z", Value::Data({1, 2, 3})},
+                                           {"a", Value::ArrayOf({Value::String("x"), Value::Integer(-1)})},
+                                           {"m", Value::DictionaryOf({{"caf\u00e9", Value::Boolean(true)}})}});
+  const std::string xml = *EncodeXmlPropertyList(value);
+  const Bytes binary = *EncodeBinaryPropertyList(value);
+  const Bytes text(xml.begin(), xml.end());
+  for (const Bytes* bytes : {&binary, &text}) {
+    Result<std::unique_ptr<PlistDocument>> document = PlistDocument::Open(*bytes);
+    ASSERT_TRUE(document.ok()) << document.error().message();
+    const PlistNode top = (*document)->top();
+    EXPECT_TRUE(StrictlyEqual(*top.value(), value));
+    std::vector<std::string> keys;
+    top.forEachEntry([&](const std::string& key, const PlistNode&) {
+      keys.push_back(key);
+      return key != "m";
+    });
+    EXPECT_EQ(keys, (std::vector<std::string>{"a", "m"}));
+    const std::optional<std::span<const uint8_t>> data = top.get("z").data();
+    ASSERT_TRUE(data.has_value());
+    EXPECT_EQ(Bytes(data->begin(), data->end()), (Bytes{1, 2, 3}));
+    if (bytes == &binary) {
+      EXPECT_TRUE(data->data() > binary.data() && data->data() < binary.data() + binary.size());
+    }
+    EXPECT_EQ(top.get("a").type(), Value::Type::kArray);
+    EXPECT_EQ(top.get("a").count(), 2u);
+    EXPECT_TRUE(StrictlyEqual(*top.get("m").get("caf\u00e9").value(), Value::Boolean(true)));
+    EXPECT_FALSE(top.get("a").data().has_value());
+  }
 }
 
 TEST(BinaryPlistHostileTest, OddButValidEncodingsAreRead) {

@@ -60,21 +60,29 @@ Bytes TestPki::Sign(const Bytes& bytes, const std::string& keyFile) {
   return FileBytes(work / "sig");
 }
 
+Bytes Encode(const Value& value, PlistFormat format) {
+  if (format == PlistFormat::kBinary) return *EncodeBinaryPropertyList(value);
+  const std::string xml = *EncodeXmlPropertyList(value);
+  return Bytes(xml.begin(), xml.end());
+}
+
 Bytes TestPki::signedManifest(const Value& payload, const std::vector<std::string>& chain, const std::string& key,
-                              Value version, bool flipPayload) const {
-  Bytes payloadBytes = *EncodeBinaryPropertyList(payload);
+                              Value version, bool flipPayload, PlistFormat outer, PlistFormat inner) const {
+  Bytes payloadBytes = Encode(payload, inner);
   const Bytes signature = Sign(payloadBytes, file(key));
   if (flipPayload) payloadBytes[payloadBytes.size() / 2] ^= 1;
   Array certificates;
   for (const std::string& der : chain) certificates.push_back(Value::Data(FileBytes(file(der))));
-  return *EncodeBinaryPropertyList(Value::DictionaryOf({{"Version", version},
-                                                       {"Certificate", Value::ArrayOf(certificates)},
-                                                       {"Payload", Value::Data(payloadBytes)},
-                                                       {"Signature", Value::Data(signature)}}));
+  return Encode(Value::DictionaryOf({{"Version", version},
+                                     {"Certificate", Value::ArrayOf(certificates)},
+                                     {"Payload", Value::Data(payloadBytes)},
+                                     {"Signature", Value::Data(signature)}}),
+                outer);
 }
 
-Bytes TestPki::productionSigned(const Value& payload) const {
-  return signedManifest(payload, {"signer.der", "intermediate.der"}, "signer.key");
+Bytes TestPki::productionSigned(const Value& payload, PlistFormat outer, PlistFormat inner) const {
+  return signedManifest(payload, {"signer.der", "intermediate.der"}, "signer.key", Value::Integer(2), false, outer,
+                        inner);
 }
 
 }  // namespace vtr::testing

@@ -9,9 +9,13 @@
 #include <string>
 #include <vector>
 
+#include "platform/plist.h"
 #include "platform/value.h"
 
 namespace vtr::testing {
+
+// A property list's bytes in format.
+Bytes Encode(const Value& value, PlistFormat format);
 
 class TestPki {
  public:
@@ -27,11 +31,14 @@ class TestPki {
   static Bytes Sign(const Bytes& bytes, const std::string& keyFile);
 
   // A signed manifest file's bytes: payload signed with keyFile, the
-  // certificates of chain (names of .der files, leaf first).
+  // certificates of chain (names of .der files, leaf first); the file and
+  // its payload in the formats given.
   Bytes signedManifest(const Value& payload, const std::vector<std::string>& chain, const std::string& key,
-                       Value version = Value::Integer(2), bool flipPayload = false) const;
+                       Value version = Value::Integer(2), bool flipPayload = false,
+                       PlistFormat outer = PlistFormat::kBinary, PlistFormat inner = PlistFormat::kBinary) const;
   // Signed by "signer" with its intermediate.
-  Bytes productionSigned(const Value& payload) const;
+  Bytes productionSigned(const Value& payload, PlistFormat outer = PlistFormat::kBinary,
+                         PlistFormat inner = PlistFormat::kBinary) const;
 
  private:
   TestPki();

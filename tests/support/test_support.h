@@ -67,6 +67,16 @@ class LogCapture {
 // True when the tests run as root (ownership and mount tests need it).
 bool IsRoot();
 
+// Whether this build runs under the address sanitizer, which changes how
+// much memory a process takes.
+#if defined(__SANITIZE_ADDRESS__)
+inline constexpr bool kUnderAddressSanitizer = true;
+#elif defined(__has_feature)
+inline constexpr bool kUnderAddressSanitizer = __has_feature(address_sanitizer);
+#else
+inline constexpr bool kUnderAddressSanitizer = false;
+#endif
+
 // Runs body in a forked child after setUp (which answers false when the child
 // cannot be prepared) and returns what body returned, or a text in angle
 // brackets saying what went wrong ("<fork failed>", "<child failed, ...>").

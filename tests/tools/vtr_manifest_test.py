@@ -261,6 +261,157 @@ class ShowAndCompareTest(unittest.TestCase):
         self.assertEqual(run("--help").returncode, 0)
 
 
+def make_pki(folder, name):
+    """A SHA-1 signed root in folder/NAME-anchors and a signer it issued;
+    returns (anchors folder, signer key, signer certificate)."""
+    quiet = {"check": True, "capture_output": True}
+    anchors = os.path.join(folder, name + "-anchors")
+    os.makedirs(anchors)
+    root_key, root = os.path.join(folder, name + "-root.key"), os.path.join(anchors, "root.pem")
+    key, csr, cert = (os.path.join(folder, name + suffix) for suffix in (".key", ".csr", ".pem"))
+    subprocess.run(["openssl", "req", "-x509", "-newkey", "rsa:2048", "-nodes", "-sha1", "-days", "2", "-subj",
+                    f"/CN={name} root", "-keyout", root_key, "-out", root], **quiet)
+    subprocess.run(["openssl", "req", "-newkey", "rsa:2048", "-nodes", "-subj", f"/CN={name} signer", "-keyout", key,
+                    "-out", csr], **quiet)
+    subprocess.run(["openssl", "x509", "-req", "-sha1", "-days", "1", "-in", csr, "-CA", root, "-CAkey", root_key,
+                    "-CAcreateserial", "-out", cert], **quiet)
+    return anchors, key, cert
+
+
+class SignedManifestTest(unittest.TestCase):
+    """sign, verify and inspect against a throwaway PKI made here."""
+
+    @classmethod
+    def setUpClass(cls):
+        cls.tmp = tempfile.mkdtemp()
+        cls.root = os.path.join(cls.tmp, "tree")
+        make_tree(cls.root)
+        cls.manifest = os.path.join(cls.tmp, "manifest.plist")
+        subprocess.run([os.path.join(BIN, "vtr-manifest"), "create", cls.root, "-o", cls.manifest], check=True)
+        cls.anchors, cls.key, cls.cert = make_pki(cls.tmp, "tool")
+        cls.other_anchors, _, _ = make_pki(cls.tmp, "other")
+        cls.efivars = os.path.join(cls.tmp, "efivars")  # no Secure Boot answer: never the host's
+        os.makedirs(cls.efivars)
+
+    @classmethod
+    def tearDownClass(cls):
+        shutil.rmtree(cls.tmp)
+
+    def sign(self, name, *extra):
+        out = os.path.join(self.tmp, name)
+        result = run("sign", self.manifest, "--key", self.key, "--certificate", self.cert, "-o", out, *extra)
+        self.assertEqual(result.returncode, 0, result.stderr)
+        return out
+
+    def verify(self, path, anchors=None):
+        return run("verify", path, "--anchors", anchors or self.anchors, "--test-anchors",
+                   os.path.join(self.tmp, "none"), "--efivars", self.efivars)
+
+    def rewritten(self, path, name, change):
+        """A copy of the signed manifest at path with change applied to its
+        outer dictionary."""
+        with open(path, "rb") as f:
+            outer = plistlib.load(f)
+        change(outer)
+        out = os.path.join(self.tmp, name)
+        with open(out, "wb") as f:
+            plistlib.dump(outer, f, fmt=plistlib.FMT_BINARY)
+        return out
+
+    def test_a_signed_manifest_holds_its_manifests_and_verifies(self):
+        with open(self.manifest, "rb") as f:
+            records = plistlib.load(f)
+        for name, extra in (("binary.plist", []), ("xml.plist", ["--xml"])):
+            with self.subTest(name=name):
+                signed = self.sign(name, "--app-data", f"com.example.app={self.manifest}", "--group-data",
+                                   f"group.example={self.manifest}", "--payload-version", "4", "--info", "a demo", *extra)
+                with open(signed, "rb") as f:
+                    self.assertEqual(f.read(6) == b"<?xml ", bool(extra))
+                with open(signed, "rb") as f:
+                    outer = plistlib.load(f)
+                payload = plistlib.loads(outer["Payload"])
+                self.assertEqual(outer["Version"], 2)
+                self.assertEqual(payload["Version"], 4)
+                # XML carries dates to the whole second only.
+                expected = records if not extra else plistlib.loads(plistlib.dumps(records))
+                self.assertEqual(payload["Backup"], expected)
+                self.assertEqual(payload["AppData"], {"com.example.app": {"Manifest": expected}})
+                self.assertEqual(payload["GroupData"], {"group.example": expected})
+                self.assertNotIn("ExtensionData", payload)
+                result = self.verify(signed)
+                self.assertEqual(result.returncode, 0, result.stderr)
+                self.assertIn(f"{len(records)} records", result.stdout.decode())
+                self.assertIn("Manifest passed signature check.", result.stderr.decode())
+                # The signed manifest shows and compares as the manifest it holds.
+                self.assertEqual(run("show", signed).stdout, run("show", self.manifest).stdout)
+                self.assertEqual(run("compare", signed, self.root).returncode, 0)
+
+    def test_verify_answers_by_cause(self):
+        signed = self.sign("causes.plist")
+
+        def flip(outer):
+            payload = bytearray(outer["Payload"])
+            payload[len(payload) // 2] ^= 1
+            outer["Payload"] = bytes(payload)
+
+        cases = [
+            ("another root", signed, self.other_anchors, 5, "Certificate not valid."),
+            ("a flipped payload byte", self.rewritten(signed, "flipped.plist", flip), None, 6,
+             "the signature does not sign the payload"),
+            ("outer version 3", self.rewritten(signed, "v3.plist", lambda o: o.update(Version=3)), None, 4,
+             "signed manifest version 3 is not supported yet"),
+            ("no certificates", self.rewritten(signed, "nocert.plist", lambda o: o.pop("Certificate")), None, 3,
+             "cannot find certificates, or certificate format not correct."),
+            ("not a property list", self.manifest + ".missing", None, 2, "No such file"),
+        ]
+        garbage = os.path.join(self.tmp, "garbage.plist")
+        with open(garbage, "wb") as f:
+            f.write(b"bplist00 not really")
+        cases.append(("garbage", garbage, None, 3, "Cannot convert to property list"))
+        for name, path, anchors, status, message in cases:
+            with self.subTest(name=name):
+                result = self.verify(path, anchors)
+                self.assertEqual(result.returncode, status, result.stderr)
+                self.assertIn(message, result.stderr.decode())
+
+    def test_inspect_shows_the_outer_fields_and_the_payload(self):
+        signed = self.sign("inspect.plist", "--app-data", f"com.example.app={self.manifest}", "--info", "shown")
+        result = run("inspect", signed, "--json")
+        self.assertEqual(result.returncode, 0, result.stderr)
+        description = json.loads(result.stdout)
+        self.assertEqual(description["version"], 2)
+        [certificate] = description["certificates"]
+        self.assertEqual(certificate["subject"], "CN=tool signer")
+        self.assertEqual(certificate["issuer"], "CN=tool root")
+        self.assertRegex(certificate["notAfter"], r"^\d{4}-\d\d-\d\dT\d\d:\d\d:\d\dZ$")
+        with open(self.manifest, "rb") as f:
+            count = len(plistlib.load(f))
+        self.assertEqual(description["payload"]["records"], count)
+        self.assertEqual(description["payload"]["appData"], {"com.example.app": count})
+        self.assertEqual(description["payload"]["info"], {"Description": "shown"})
+        text = run("inspect", signed).stdout.decode()
+        self.assertIn("certificate 0: CN=tool signer", text)
+        self.assertIn(f"appData com.example.app: {count} records", text)
+        self.assertEqual(run("inspect", self.manifest).returncode, 2)
+
+    def test_sign_refuses_what_it_cannot_use(self):
+        signed = self.sign("refuse.plist")
+        for args in (["--key", self.cert, "--certificate", self.cert],                # no private key
+                     ["--key", self.key, "--certificate", self.key],                  # no certificate
+                     ["--key", self.key, "--certificate", self.cert, "--app-data", f"a={signed}"]):  # signed
+            with self.subTest(args=args):
+                result = run("sign", self.manifest, "-o", os.path.join(self.tmp, "never.plist"), *args)
+                self.assertEqual(result.returncode, 2, result.stderr)
+                self.assertFalse(os.path.exists(os.path.join(self.tmp, "never.plist")))
+        for args in (["sign", self.manifest, "-o", "x"], ["sign", self.manifest, "--key", self.key, "-o", "x"],
+                     ["sign", self.manifest, "--key", self.key, "--certificate", self.cert, "-o", "x",
+                      "--app-data", "no-equals"],
+                     ["sign", self.manifest, "--key", self.key, "--certificate", self.cert, "-o", "x",
+                      "--payload-version", "5"]):
+            with self.subTest(args=args):
+                self.assertEqual(run(*args).returncode, 64)
+
+
 if __name__ == "__main__":
     BIN = sys.argv.pop(1)
     unittest.main()

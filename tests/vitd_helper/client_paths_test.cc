@@ -136,12 +136,31 @@ TEST(ClientPathResolverTest, NoLinkIsFollowedAtAnyPosition) {
       {"/link/", ELOOP},     {"/real/dlink", ELOOP},   {"/real/dlink/", ELOOP},
       {"/real/file", ENOTDIR}, {"/real/file/", ENOTDIR}, {"/real/missing", ENOENT},
   };
-  for (const auto& c : cases) {
-    Result<std::vector<std::string>> components = SplitPathComponents(c.path);
-    ASSERT_TRUE(components.ok());
-    Result<UniqueFd> opened = OpenDirectoryBeneath(rootFd.get(), *components, components->size());
-    EXPECT_EQ(opened.ok() ? 0 : opened.error().code(), c.error) << c.path;
+  // A chain keeping its directories open answers each path the same, in
+  // any order, after failures too, and reaches the same directories.
+  OpenDirectoryChain chain(rootFd.get());
+  for (int round = 0; round < 2; ++round) {
+    for (const auto& c : cases) {
+      Result<std::vector<std::string>> components = SplitPathComponents(c.path);
+      ASSERT_TRUE(components.ok());
+      Result<UniqueFd> opened = OpenDirectoryBeneath(rootFd.get(), *components, components->size());
+      EXPECT_EQ(opened.ok() ? 0 : opened.error().code(), c.error) << c.path;
+      Result<int> chained = chain.open(*components, components->size());
+      EXPECT_EQ(chained.ok() ? 0 : chained.error().code(), c.error) << c.path;
+      struct stat a, b;
+      if (opened.ok() && chained.ok() && ::fstat(opened->get(), &a) == 0 && ::fstat(*chained, &b) == 0) {
+        EXPECT_EQ(a.st_ino, b.st_ino) << c.path;
+      }
+    }
   }
+  // A link planted where the chain had a directory is met, not followed,
+  // once a path that differs earlier has been opened in between.
+  Result<std::vector<std::string>> inD = SplitPathComponents("/real/d/x");
+  ASSERT_TRUE(chain.open(*inD, 2).ok());
+  ASSERT_EQ(::rename((root / "real").c_str(), (root / "moved").c_str()), 0);
+  ASSERT_EQ(::symlink("moved", (root / "real").c_str()), 0);
+  EXPECT_EQ(chain.open({"link"}, 1).error().code(), ELOOP);
+  EXPECT_EQ(chain.open(*inD, 2).error().code(), ELOOP);
   // Creating on the way stops at a link too, and makes nothing behind it.
   Result<std::vector<std::string>> through = SplitPathComponents("/link/new/deeper");
   EXPECT_EQ(OpenDirectoryBeneath(rootFd.get(), *through, 3, true).error().code(), ELOOP);

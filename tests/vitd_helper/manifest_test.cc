@@ -1,13 +1,18 @@
 // The manifest and staging commands, end to end in a sandbox root.
 #include <sys/stat.h>
 #include <sys/xattr.h>
+#include <fcntl.h>
 #include <unistd.h>
 
 #include <cstdlib>
+#include <fstream>
 
 #include <gtest/gtest.h>
 
+#include "model/file_metadata.h"
+#include "platform/format.h"
 #include "platform/plist.h"
+#include "platform/unique_fd.h"
 #include "tests/support/file_inspection.h"
 #include "tests/support/test_pki.h"
 #include "tests/support/test_support.h"
@@ -213,6 +218,66 @@ TEST_F(ManifestTest, RestoreAttributesFromASignedManifestOfTheHelpersOwnRecords)
                                                 "AppData", "--identifier", "com.none"});
   EXPECT_EQ(restored.output, "{\"Response\":false}\n");
   EXPECT_TRUE(sandbox_.logged("Couldn't load container data for AppData/com.none"));
+}
+
+// The peak resident memory of process pid so far, in bytes.
+uint64_t PeakMemory(pid_t pid) {
+  std::ifstream status("/proc/" + std::to_string(pid) + "/status");
+  for (std::string line; std::getline(status, line);) {
+    if (line.rfind("VmHWM:", 0) == 0) return std::stoull(line.substr(6)) * 1024;
+  }
+  return 0;
+}
+
+// A whole device's worth of records is read in place from the signed
+// manifest and built one at a time: the helper stays under 64 MiB plus 500
+// bytes a record (building them all would take several times that).
+TEST(RestoreMemoryTest, ManyRecordsAreRestoredWithinTheMemoryBound) {
+  if (!IsRoot()) GTEST_SKIP() << "the helper chroots into its sandbox root: needs root";
+  if (kUnderAddressSanitizer) GTEST_SKIP() << "the address sanitizer changes what memory a process takes";
+  constexpr int kDirectories = 100;
+  constexpr int kFilesEach = 1000;
+  HelperSandbox sandbox;
+  const std::string staging = sandbox.host("/private/var/staging");
+  MakeDir(staging);
+  WriteFile(staging + "/template", "");
+  const Value model = VTRFileMetadata::initWithPath(staging + "/template")->dict();
+
+  // The content as the daemon laid it (mobile's); the records say root's,
+  // each with a hash of its own.
+  DictionaryBuilder records;
+  for (int d = 0; d < kDirectories; ++d) {
+    const std::string directory = Format("/d%03d", d);
+    MakeDir(staging + directory);
+    for (int f = 0; f < kFilesEach; ++f) {
+      const std::string key = Format("%s/f%04d", directory, f);
+      UniqueFd file(::open((staging + key).c_str(), O_CREAT | O_WRONLY | O_CLOEXEC, 0600));
+      ASSERT_TRUE(file && ::fchown(file.get(), kMobileUid, kMobileGid) == 0) << key;
+      DictionaryBuilder record;
+      for (const auto& [name, value] : *model.dictionary()) {
+        record.add(name, name == kVTRManifestFileHash ? Value::Data(key.data(), 20) : value);
+      }
+      records.add(key, record.build());
+    }
+  }
+  const TestPki& pki = TestPki::Get();
+  const std::string anchors = sandbox.host("/usr/share/vitd/anchors/production");
+  ASSERT_EQ(std::system(("mkdir -p '" + anchors + "' && cp '" + pki.file("production") + "'/*.pem '" + anchors + "'").c_str()), 0);
+  const Bytes signedManifest = pki.productionSigned(Value::DictionaryOf(
+      {{"Version", Value::Integer(3)}, {"Info", Value::String("many")}, {"Backup", records.build()},
+       {"App", Value::ArrayOf({})}, {"AppData", Value::DictionaryOf({})}}));
+  WriteFile(sandbox.host("/private/var/many.plist"), std::string(signedManifest.begin(), signedManifest.end()));
+
+  ASSERT_TRUE(sandbox.start()) << sandbox.log();
+  const HelperSandbox::RunResult restored =
+      sandbox.run(VitdctlExecutable(), {"--root", sandbox.root(), "--timeout", "120", "restoreAttributes",
+                                        "/private/var/staging", "/private/var/many.plist"});
+  EXPECT_EQ(restored.output, "{\"Response\":true}\n") << sandbox.log();
+  const uint64_t peak = PeakMemory(sandbox.pid());
+  ASSERT_GT(peak, 0u) << "the helper's peak memory could not be read";
+  const uint64_t bound = (uint64_t{64} << 20) + uint64_t{500} * kDirectories * kFilesEach;
+  EXPECT_LT(peak, bound) << "peak " << peak / 1024 << " KiB";
+  EXPECT_EQ(Lstat(staging + Format("/d%03d/f%04d", kDirectories - 1, kFilesEach - 1)).st_uid, 0u);
 }
 
 }  // namespace

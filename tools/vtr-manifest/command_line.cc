@@ -13,7 +13,10 @@ constexpr unsigned kMaxJobs = 64;
 constexpr unsigned Bit(Command command) { return 1u << static_cast<unsigned>(command); }
 constexpr unsigned kWalking = Bit(Command::kCreate) | Bit(Command::kCompare);
 constexpr unsigned kReading = Bit(Command::kShow) | Bit(Command::kCompare);
-constexpr unsigned kAll = Bit(Command::kCreate) | Bit(Command::kShow) | Bit(Command::kCompare);
+constexpr unsigned kAll = Bit(Command::kCreate) | Bit(Command::kShow) | Bit(Command::kCompare) |
+                          Bit(Command::kSign) | Bit(Command::kVerify) | Bit(Command::kInspect);
+constexpr unsigned kSigning = Bit(Command::kSign);
+constexpr unsigned kVerifying = Bit(Command::kVerify);
 
 WalkOptions& Walk(CommandLine& c) { return c.command == Command::kCreate ? c.create.walk : c.compare.walk; }
 ManifestSelection& Selection(CommandLine& c) {
@@ -44,6 +47,22 @@ Status ParseFormat(const std::string& text, ShowFormat* format) {
   return Error::Invalid("--format takes text, json or xml");
 }
 
+// "ID=FILE" of a container option.
+Status ParseContainer(const std::string& text, std::vector<std::pair<std::string, std::string>>* containers) {
+  const size_t equals = text.find('=');
+  if (equals == std::string::npos || equals == 0 || equals + 1 == text.size()) {
+    return Error::Invalid("a container is given as ID=MANIFEST");
+  }
+  containers->emplace_back(text.substr(0, equals), text.substr(equals + 1));
+  return Status::Ok();
+}
+
+Status ParsePayloadVersion(const std::string& text, int32_t* version) {
+  if (text != "3" && text != "4") return Error::Invalid("--payload-version takes 3 or 4");
+  *version = text[0] - '0';
+  return Status::Ok();
+}
+
 struct Option {
   const char* name;
   bool takesValue;
@@ -59,8 +78,32 @@ const Option kOptions[] = {
     {"--skip", true, kWalking,
      [](CommandLine& c, const std::string& v) { Walk(c).skip.push_back(v); return Status::Ok(); }},
     {"--jobs", true, kWalking, [](CommandLine& c, const std::string& v) { return ParseJobs(v, &Walk(c).jobs); }},
-    {"-o", true, Bit(Command::kCreate),
-     [](CommandLine& c, const std::string& v) { c.create.output = v; return Status::Ok(); }},
+    {"-o", true, Bit(Command::kCreate) | kSigning,
+     [](CommandLine& c, const std::string& v) {
+       (c.command == Command::kSign ? c.sign.output : c.create.output) = v;
+       return Status::Ok();
+     }},
+    {"--key", true, kSigning, [](CommandLine& c, const std::string& v) { c.sign.key = v; return Status::Ok(); }},
+    {"--certificate", true, kSigning,
+     [](CommandLine& c, const std::string& v) { c.sign.certificates.push_back(v); return Status::Ok(); }},
+    {"--app-data", true, kSigning,
+     [](CommandLine& c, const std::string& v) { return ParseContainer(v, &c.sign.appData); }},
+    {"--group-data", true, kSigning,
+     [](CommandLine& c, const std::string& v) { return ParseContainer(v, &c.sign.groupData); }},
+    {"--extension-data", true, kSigning,
+     [](CommandLine& c, const std::string& v) { return ParseContainer(v, &c.sign.extensionData); }},
+    {"--payload-version", true, kSigning,
+     [](CommandLine& c, const std::string& v) { return ParsePayloadVersion(v, &c.sign.payloadVersion); }},
+    {"--info", true, kSigning, [](CommandLine& c, const std::string& v) { c.sign.info = v; return Status::Ok(); }},
+    {"--xml", false, kSigning, [](CommandLine& c, const std::string&) { c.sign.xml = true; return Status::Ok(); }},
+    {"--anchors", true, kVerifying,
+     [](CommandLine& c, const std::string& v) { c.verify.anchors.production = v; return Status::Ok(); }},
+    {"--test-anchors", true, kVerifying,
+     [](CommandLine& c, const std::string& v) { c.verify.anchors.test = v; return Status::Ok(); }},
+    {"--efivars", true, kVerifying,
+     [](CommandLine& c, const std::string& v) { c.verify.anchors.efiVariables = v; return Status::Ok(); }},
+    {"--json", false, Bit(Command::kInspect),
+     [](CommandLine& c, const std::string&) { c.inspect.json = true; return Status::Ok(); }},
     {"--format", true, Bit(Command::kShow),
      [](CommandLine& c, const std::string& v) { return ParseFormat(v, &c.show.format); }},
     {"--path", true, Bit(Command::kShow),
@@ -74,7 +117,8 @@ const struct {
   const char* name;
   Command command;
   size_t operands;  // FILE and/or DIR
-} kCommands[] = {{"create", Command::kCreate, 1}, {"show", Command::kShow, 1}, {"compare", Command::kCompare, 2}};
+} kCommands[] = {{"create", Command::kCreate, 1}, {"show", Command::kShow, 1},     {"compare", Command::kCompare, 2},
+                 {"sign", Command::kSign, 1},     {"verify", Command::kVerify, 1}, {"inspect", Command::kInspect, 1}};
 
 // The option arg names ("--name" or "--name=value"), or null.
 const Option* FindOption(const std::string& arg) {
@@ -98,6 +142,14 @@ Status SetOperands(CommandLine& c, const std::vector<std::string>& operands) {
       c.compare.manifest.file = operands[0];
       c.compare.walk.tree = operands[1];
       break;
+    case Command::kSign:
+      c.sign.manifest = operands[0];
+      if (c.sign.output.empty()) return Error::Invalid("sign needs -o FILE");
+      if (c.sign.key.empty()) return Error::Invalid("sign needs --key KEY");
+      if (c.sign.certificates.empty()) return Error::Invalid("sign needs --certificate CERT (the signer's first)");
+      break;
+    case Command::kVerify: c.verify.file = operands[0]; break;
+    case Command::kInspect: c.inspect.file = operands[0]; break;
     case Command::kHelp: break;
   }
   return Status::Ok();
@@ -169,6 +221,11 @@ void PrintUsage(FILE* out) {
       "  vtr-manifest show FILE [--format text|json|xml] [--path KEY] [--container ID]\n"
       "  vtr-manifest compare FILE DIR [--relative-to R] [--inclusive] [--skip PATH]... [--jobs N]\n"
       "                       [--container ID]\n"
+      "  vtr-manifest sign MANIFEST --key KEY --certificate CERT... -o FILE [--app-data ID=MANIFEST]...\n"
+      "                    [--group-data ID=MANIFEST]... [--extension-data ID=MANIFEST]...\n"
+      "                    [--payload-version 3|4] [--info TEXT] [--xml]\n"
+      "  vtr-manifest verify FILE [--anchors DIR] [--test-anchors DIR] [--efivars DIR]\n"
+      "  vtr-manifest inspect FILE [--json]\n"
       "\n"
       "create   writes the manifest of the tree DIR (each item's attributes, extended\n"
       "         attributes, SHA-1 and link target, keyed by its path relative to R,\n"
@@ -182,14 +239,28 @@ void PrintUsage(FILE* out) {
       "         manifest FILE as \"CODE NAME PATH\": 1 type-differs, 2 content-differs,\n"
       "         3 link-target-differs, 4 owner-or-mode-differs, 5 xattrs-differ,\n"
       "         0 missing-on-disk, and \"- not-in-manifest\" for items FILE lacks.\n"
+      "sign     writes a signed manifest: a payload holding MANIFEST as the whole-device\n"
+      "         manifest (\"Backup\") and each --app-data/--group-data/--extension-data\n"
+      "         manifest under its identifier, signed (RSA, PKCS#1 v1.5, SHA-1) with the\n"
+      "         PEM key KEY; the certificates (PEM or DER, the signer's first, then its\n"
+      "         intermediates) go into the file. Binary unless --xml.\n"
+      "verify   checks a signed manifest as the helper does, with the helper's messages:\n"
+      "         the chain against the PEM roots in --anchors (default\n"
+      "         /usr/share/vitd/anchors/production), or on a device whose Secure Boot\n"
+      "         variable in --efivars says it is not fused, --test-anchors (default\n"
+      "         /usr/share/vitd/anchors/test); then the signature of the payload.\n"
+      "inspect  prints a signed manifest's version, certificates (subject, issuer,\n"
+      "         validity), signature size and a summary of its payload; no check.\n"
       "\n"
       "Options:\n"
       "  --jobs N     threads reading files (0: one item at a time on the main thread)\n"
       "  --verbose    show every message of the builder, progress messages included\n"
       "  --help       show this text\n"
       "\n"
-      "Exit status: 0 success (compare: the tree matches), 1 compare found differences\n"
-      "or show found no such entry, 2 the work could not be done, 64 usage error.\n",
+      "Exit status: 0 success (compare: the tree matches; verify: trusted), 1 compare\n"
+      "found differences or show found no such entry, 2 the work could not be done,\n"
+      "verify: 3 malformed, 4 unsupported version, 5 chain not trusted, 6 bad\n"
+      "signature; 64 usage error.\n",
       out);
 }
 

@@ -12,11 +12,14 @@
 namespace vtr::manifest_tool {
 
 struct CommandLine {
-  enum class Command { kHelp, kCreate, kShow, kCompare } command = Command::kHelp;
+  enum class Command { kHelp, kCreate, kShow, kCompare, kSign, kVerify, kInspect } command = Command::kHelp;
   bool verbose = false;
   CreateOptions create;
   ShowOptions show;
   CompareOptions compare;
+  SignOptions sign;
+  VerifyOptions verify;
+  InspectOptions inspect;
 };
 
 // Parses the arguments after the program name. The error's message says

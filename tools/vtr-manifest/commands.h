@@ -6,9 +6,11 @@
 
 #include <cstdio>
 #include <optional>
+#include <utility>
 #include <string>
 #include <vector>
 
+#include "model/signed_manifest.h"
 #include "tools/vtr-manifest/console.h"
 
 namespace vtr::manifest_tool {
@@ -16,6 +18,11 @@ namespace vtr::manifest_tool {
 inline constexpr int kExitOk = 0;
 inline constexpr int kExitFailure = 1;  // compare: the tree differs from the manifest
 inline constexpr int kExitError = 2;    // the command could not do its work
+// verify, by cause: what keeps a signed manifest from being trusted.
+inline constexpr int kExitMalformed = 3;           // not a signed manifest of the expected form
+inline constexpr int kExitUnsupportedVersion = 4;  // outer or payload version not read
+inline constexpr int kExitNotTrusted = 5;          // no policy trusts the certificate chain
+inline constexpr int kExitBadSignature = 6;        // the signature does not sign the payload
 inline constexpr int kExitUsage = 64;
 
 // What is walked, and how, for create and compare.
@@ -52,6 +59,31 @@ struct CompareOptions {
   WalkOptions walk;
 };
 
+// A signed manifest made of manifests: the payload holds the whole-device
+// manifest as "Backup" and each container's under its list.
+struct SignOptions {
+  std::string manifest;
+  std::vector<std::pair<std::string, std::string>> appData;  // (identifier, manifest file)
+  std::vector<std::pair<std::string, std::string>> groupData;
+  std::vector<std::pair<std::string, std::string>> extensionData;
+  std::string key;                        // PEM private key
+  std::vector<std::string> certificates;  // PEM or DER, leaf first
+  std::string output;
+  int32_t payloadVersion = 3;
+  std::string info;  // the payload's "Info" description
+  bool xml = false;  // XML file and payload instead of binary
+};
+
+struct VerifyOptions {
+  std::string file;
+  SigningAnchors anchors;
+};
+
+struct InspectOptions {
+  std::string file;
+  bool json = false;
+};
+
 // Writes the manifest of the tree to options.output, streamed exactly as the
 // helper writes the device manifest. 0 when the fill succeeded and the file
 // was written.
@@ -66,6 +98,21 @@ int RunShow(const ShowOptions& options, FILE* out, Console& console);
 // matched, "- not-in-manifest PATH" for an item the manifest lacks. 0 only
 // when no line was printed.
 int RunCompare(const CompareOptions& options, FILE* out, Console& console);
+
+// Builds the payload of options' manifests, signs it and writes the signed
+// manifest to options.output.
+int RunSign(const SignOptions& options, Console& console);
+
+// Reads the signed manifest as the helper does, with its messages, and
+// answers by cause: 0 trusted and well signed, else kExitMalformed,
+// kExitUnsupportedVersion, kExitNotTrusted, kExitBadSignature, or
+// kExitError when the file cannot be read.
+int RunVerify(const VerifyOptions& options, FILE* out, Console& console);
+
+// Prints the outer fields of a signed manifest (version, each certificate's
+// subject, issuer and validity, the signature's size) and a summary of its
+// payload, as text or JSON. The signature is not checked.
+int RunInspect(const InspectOptions& options, FILE* out, Console& console);
 
 }  // namespace vtr::manifest_tool
 

@@ -1,4 +1,5 @@
-// vtr-manifest: create, show and compare manifests of file trees.
+// vtr-manifest: create, show and compare manifests of file trees; sign,
+// verify and inspect signed manifests.
 #include <unistd.h>
 
 #include <cstdio>
@@ -25,6 +26,9 @@ int main(int argc, char** argv) {
     case CommandLine::Command::kCreate: return RunCreate(line->create, *console);
     case CommandLine::Command::kShow: return RunShow(line->show, stdout, *console);
     case CommandLine::Command::kCompare: return RunCompare(line->compare, stdout, *console);
+    case CommandLine::Command::kSign: return RunSign(line->sign, *console);
+    case CommandLine::Command::kVerify: return RunVerify(line->verify, stdout, *console);
+    case CommandLine::Command::kInspect: return RunInspect(line->inspect, stdout, *console);
   }
   return kExitUsage;
 }

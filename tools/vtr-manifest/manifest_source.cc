@@ -1,46 +1,82 @@
 #include "tools/vtr-manifest/manifest_source.h"
 
-#include "platform/plist.h"
+#include <fcntl.h>
+#include <sys/stat.h>
+
+#include "platform/read_fully.h"
+#include "platform/unique_fd.h"
 
 namespace vtr::manifest_tool {
 namespace {
 
-bool IsSignedManifest(const Value& top) {
-  const Dictionary* dictionary = top.dictionary();
-  return dictionary != nullptr && top.get("Payload").data() != nullptr &&
-         (dictionary->contains("Certificate") || dictionary->contains("Signature"));
+// Largest file read: far above a whole device's manifest.
+constexpr size_t kMaxFileBytes = size_t{2} << 30;
+
+bool IsSignedManifest(const PlistNode& top) {
+  return top.isDictionary() && top.get("Payload").data().has_value() &&
+         (!top.get("Certificate").isNil() || !top.get("Signature").isNil());
 }
 
-Result<Value> ContainerManifest(const Value& payload, const std::string& container) {
-  const Value apps = payload.get("AppData");
-  const Value* app = apps.dictionary() != nullptr ? apps.dictionary()->find(container) : nullptr;
-  if (app != nullptr && app->get("Manifest").dictionary() != nullptr) return app->get("Manifest");
-  for (const char* list : {"GroupData", "ExtensionData"}) {
-    const Dictionary* containers = payload.get(list).dictionary();
-    const Value* manifest = containers != nullptr ? containers->find(container) : nullptr;
-    if (manifest != nullptr && manifest->dictionary() != nullptr) return *manifest;
+// The manifest of a container in a signed manifest, looked for in
+// "AppData" (under "Manifest"), then "GroupData" and "ExtensionData";
+// nil when none holds it.
+PlistNode ContainerManifest(const VTRSignedManifest& manifest, const std::string& container) {
+  const PlistNode app = manifest.getAppDataList().get(container).get("Manifest");
+  if (app.isDictionary()) return app;
+  for (const PlistNode& list : {manifest.getGroupDataList(), manifest.getPlugInDataList()}) {
+    const PlistNode found = list.get(container);
+    if (found.isDictionary()) return found;
   }
-  return Error::Invalid("the signed manifest holds no manifest for container " + container);
+  return PlistNode();
 }
 
 }  // namespace
 
-Result<Value> LoadManifest(const ManifestSelection& selection) {
-  Result<Value> top = ReadPropertyListFile(selection.file);
-  if (!top.ok()) return top.error();
-  if (!IsSignedManifest(*top)) {
-    if (selection.container) return Error::Invalid(selection.file + " is not a signed manifest");
-    if (top->dictionary() == nullptr) return Error::Invalid(selection.file + " does not hold a dictionary");
-    return std::move(*top);
+Result<std::string> ReadWholeFile(const std::string& path) {
+  UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
+  if (!fd) return Error::FromErrno(path);
+  struct stat st;
+  if (::fstat(fd.get(), &st) != 0) return Error::FromErrno(path);
+  if (!S_ISREG(st.st_mode)) return Error::Invalid(path + " is not a regular file");
+  Result<std::string> bytes = ReadFully(fd.get(), kMaxFileBytes);
+  if (!bytes.ok()) return Error(bytes.error().code(), path + ": " + bytes.error().message());
+  return bytes;
+}
+
+Result<std::unique_ptr<ManifestSource>> ManifestSource::Load(const ManifestSelection& selection) {
+  const std::string& file = selection.file;
+  std::unique_ptr<ManifestSource> source(new ManifestSource());
+  Result<std::string> bytes = ReadWholeFile(file);
+  if (!bytes.ok()) return bytes.error();
+  source->bytes_ = std::move(*bytes);
+  const std::span<const uint8_t> span(reinterpret_cast<const uint8_t*>(source->bytes_.data()),
+                                      source->bytes_.size());
+  Result<std::unique_ptr<PlistDocument>> document = PlistDocument::Open(span);
+  if (!document.ok()) return Error::Invalid(file + ": " + document.error().message());
+  source->document_ = std::move(*document);
+  const PlistNode top = source->document_->top();
+  if (!IsSignedManifest(top)) {
+    if (selection.container) return Error::Invalid(file + " is not a signed manifest");
+    if (!top.isDictionary()) return Error::Invalid(file + " does not hold a dictionary");
+    source->records_ = top;
+    return source;
   }
-  Result<Value> payload = ReadPropertyList(*top->get("Payload").data());
-  if (!payload.ok()) return Error::Invalid("the payload of " + selection.file + ": " + payload.error().description());
-  if (selection.container) return ContainerManifest(*payload, *selection.container);
-  Value backup = payload->get("Backup");
-  if (backup.dictionary() == nullptr) {
-    return Error::Invalid("the payload of " + selection.file + " has no \"Backup\" manifest");
+  // The signed manifest reads the bytes again, as its own.
+  source->document_.reset();
+  source->signed_ = VTRSignedManifest::unverifiedManifestWithBytes(std::move(source->bytes_));
+  if (!source->signed_) return Error::Invalid(file + " is not a signed manifest this tool can read");
+  if (selection.container) {
+    source->records_ = ContainerManifest(*source->signed_, *selection.container);
+    if (source->records_.isNil()) {
+      return Error::Invalid("the signed manifest holds no manifest for container " + *selection.container);
+    }
+  } else {
+    source->records_ = source->signed_->getManifest();
+    if (!source->records_.isDictionary()) {
+      return Error::Invalid("the payload of " + file + " has no \"Backup\" manifest");
+    }
   }
-  return backup;
+  return source;
 }
 
 }  // namespace vtr::manifest_tool

@@ -11,51 +11,63 @@ using Json = nlohmann::json;
 
 std::string JsonText(const Json& json) { return json.dump(-1, ' ', false, Json::error_handler_t::replace); }
 
-// One entry per line inside one object, so that a manifest of a whole
-// device is never held as JSON all at once.
-void PrintJson(const Dictionary& entries, FILE* out) {
-  std::fputs("{", out);
+// Each entry is built, printed and dropped in turn; false when a record
+// cannot be built.
+bool PrintEntries(const PlistNode& records, ShowFormat format, FILE* out) {
   bool first = true;
-  for (const auto& [path, record] : entries) {
-    std::fprintf(out, "%s\n  %s: %s", first ? "" : ",", JsonText(Json(path)).c_str(), JsonText(ToJson(record)).c_str());
+  bool built = true;
+  if (format == ShowFormat::kJson) std::fputs("{", out);
+  records.forEachEntry([&](const std::string& path, const PlistNode& node) {
+    Result<Value> record = node.value();
+    if (!record.ok()) return built = false;
+    if (format == ShowFormat::kJson) {
+      // One entry per line inside one object.
+      std::fprintf(out, "%s\n  %s: %s", first ? "" : ",", JsonText(Json(path)).c_str(),
+                   JsonText(ToJson(*record)).c_str());
+    } else {
+      std::fprintf(out, "%s\n", RecordLine(path, *record).c_str());
+    }
     first = false;
-  }
-  std::fputs(first ? "}\n" : "\n}\n", out);
+    return true;
+  });
+  if (format == ShowFormat::kJson) std::fputs(first ? "}\n" : "\n}\n", out);
+  return built;
 }
 
 }  // namespace
 
 int RunShow(const ShowOptions& options, FILE* out, Console& console) {
-  Result<Value> manifest = LoadManifest(options.manifest);
-  if (!manifest.ok()) {
-    console.write("vtr-manifest: " + manifest.error().description());
+  Result<std::unique_ptr<ManifestSource>> source = ManifestSource::Load(options.manifest);
+  if (!source.ok()) {
+    console.write("vtr-manifest: " + source.error().description());
     return kExitError;
   }
+  PlistNode records = (*source)->records();
   if (options.path) {
-    const Value* record = manifest->dictionary()->find(*options.path);
-    if (record == nullptr) {
+    const PlistNode record = records.get(*options.path);
+    if (record.isNil()) {
       console.write("vtr-manifest: the manifest has no entry " + *options.path);
       return kExitFailure;
     }
-    *manifest = Value::DictionaryOf({{*options.path, *record}});
-  }
-  const Dictionary& entries = *manifest->dictionary();
-  switch (options.format) {
-    case ShowFormat::kText:
-      for (const auto& [path, record] : entries) std::fprintf(out, "%s\n", RecordLine(path, record).c_str());
-      break;
-    case ShowFormat::kJson:
-      PrintJson(entries, out);
-      break;
-    case ShowFormat::kXml: {
-      Result<std::string> xml = EncodeXmlPropertyList(*manifest);
-      if (!xml.ok()) {
-        console.write("vtr-manifest: cannot show the manifest as XML: " + xml.error().description());
-        return kExitError;
-      }
-      std::fputs(xml->c_str(), out);
-      break;
+    Result<Value> value = record.value();
+    if (!value.ok()) {
+      console.write("vtr-manifest: " + value.error().description());
+      return kExitError;
     }
+    records = PlistNode(Value::DictionaryOf({{*options.path, *value}}));
+  }
+  if (options.format == ShowFormat::kXml) {
+    // XML is written whole, so the manifest is built whole for it.
+    Result<Value> manifest = records.value();
+    Result<std::string> xml = manifest.ok() ? EncodeXmlPropertyList(*manifest) : Result<std::string>(manifest.error());
+    if (!xml.ok()) {
+      console.write("vtr-manifest: cannot show the manifest as XML: " + xml.error().description());
+      return kExitError;
+    }
+    std::fputs(xml->c_str(), out);
+  } else if (!PrintEntries(records, options.format, out)) {
+    console.write("vtr-manifest: a record of the manifest is too large to build");
+    return kExitError;
   }
   return std::fflush(out) == 0 ? kExitOk : kExitError;
 }

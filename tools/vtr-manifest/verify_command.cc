@@ -1,0 +1,44 @@
+// vtr-manifest verify: a signed manifest checked as the helper checks it.
+#include "tools/vtr-manifest/commands.h"
+#include "tools/vtr-manifest/manifest_source.h"
+
+namespace vtr::manifest_tool {
+
+int RunVerify(const VerifyOptions& options, FILE* out, Console& console) {
+  Result<std::string> bytes = ReadWholeFile(options.file);
+  if (!bytes.ok()) {
+    console.write("vtr-manifest: " + bytes.error().description());
+    return kExitError;
+  }
+  // The helper's own messages reach the console through the log.
+  SignedManifestFailure failure = SignedManifestFailure::kNone;
+  std::optional<VTRSignedManifest> manifest =
+      VTRSignedManifest::signedManifestWithBytes(std::move(*bytes), options.anchors, &failure);
+  if (manifest) {
+    std::fprintf(out, "%s: trusted and well signed; payload version %d, %llu records in \"Backup\"\n",
+                 options.file.c_str(), manifest->getVersion(),
+                 static_cast<unsigned long long>(manifest->getManifest().count()));
+    return std::fflush(out) == 0 ? kExitOk : kExitError;
+  }
+  // The cause in the tool's words too: a bad signature is only a debug
+  // trace in the helper's log.
+  const struct {
+    SignedManifestFailure failure;
+    int status;
+    const char* why;
+  } kCauses[] = {
+      {SignedManifestFailure::kUnsupportedVersion, kExitUnsupportedVersion, "its version is not supported"},
+      {SignedManifestFailure::kNotTrusted, kExitNotTrusted, "no trusted root vouches for its certificates"},
+      {SignedManifestFailure::kBadSignature, kExitBadSignature, "the signature does not sign the payload"},
+  };
+  for (const auto& cause : kCauses) {
+    if (cause.failure == failure) {
+      console.write("vtr-manifest: " + options.file + " is not trusted: " + cause.why);
+      return cause.status;
+    }
+  }
+  console.write("vtr-manifest: " + options.file + " is not a well-formed signed manifest");
+  return kExitMalformed;
+}
+
+}  // namespace vtr::manifest_tool

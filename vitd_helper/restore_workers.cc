@@ -1,0 +1,104 @@
+#include "vitd_helper/restore_workers.h"
+
+#include "model/file_metadata.h"
+#include "platform/open_beneath.h"
+#include "platform/paths.h"
+#include "vitd_helper/client_path_resolver.h"
+
+namespace vtr {
+namespace {
+
+// Records handed over at a time, and batches waiting at most: enough to
+// keep the workers busy, little memory.
+constexpr size_t kBatchSize = 64;
+constexpr size_t kMaxQueuedBatches = 8;
+
+// Lays record onto the item key names beneath the staging root; false when
+// the record is no dictionary or cannot be laid.
+bool RestoreRecord(OpenDirectoryChain& directories, const std::string& root, const std::string& key,
+                   const Value& value) {
+  if (value.dictionary() == nullptr) return false;
+  const VTRFileMetadata record(value);
+  const std::string target = AppendPathComponent(root, key);
+  // The record's own path, beneath the staging root: no "..", no link on
+  // the way; "/" is the root itself.
+  Result<std::vector<std::string>> components = SplitPathComponents("/" + key);
+  Result<int> parent = components.ok()
+                           ? directories.open(*components, components->empty() ? 0 : components->size() - 1)
+                           : Result<int>(components.error());
+  if (!parent.ok()) {
+    LogRefusal(target, parent.error());
+    return false;
+  }
+  const std::string name = components->empty() ? "." : components->back();
+  return record.restoreAttribuesToItemAt(*parent, name, target);
+}
+
+}  // namespace
+
+RestoreWorkers::RestoreWorkers(int stagingDir, std::string root, unsigned workers)
+    : stagingDir_(stagingDir), root_(std::move(root)) {
+  filling_.reserve(kBatchSize);
+  for (unsigned i = 0; i < std::max(workers, 1u); ++i) threads_.emplace_back([this] { work(); });
+}
+
+RestoreWorkers::~RestoreWorkers() {
+  if (!threads_.empty()) finish();
+}
+
+bool RestoreWorkers::add(std::string key, Value record) {
+  if (failed_.load(std::memory_order_relaxed)) return false;
+  filling_.emplace_back(std::move(key), std::move(record));
+  if (filling_.size() == kBatchSize) {
+    push(std::move(filling_));
+    filling_ = Batch();
+    filling_.reserve(kBatchSize);
+  }
+  return !failed_.load(std::memory_order_relaxed);
+}
+
+void RestoreWorkers::push(Batch batch) {
+  std::unique_lock lock(mutex_);
+  changed_.wait(lock, [this] { return queue_.size() < kMaxQueuedBatches || failed_; });
+  if (failed_) return;
+  queue_.push_back(std::move(batch));
+  changed_.notify_all();
+}
+
+bool RestoreWorkers::finish() {
+  if (!filling_.empty()) push(std::move(filling_));
+  {
+    std::lock_guard lock(mutex_);
+    closed_ = true;
+  }
+  changed_.notify_all();
+  for (std::thread& thread : threads_) thread.join();
+  threads_.clear();
+  return !failed_;
+}
+
+void RestoreWorkers::work() {
+  OpenDirectoryChain directories(stagingDir_);
+  for (;;) {
+    Batch batch;
+    {
+      std::unique_lock lock(mutex_);
+      changed_.wait(lock, [this] { return !queue_.empty() || closed_ || failed_; });
+      if (failed_ || queue_.empty()) return;
+      batch = std::move(queue_.front());
+      queue_.pop_front();
+    }
+    changed_.notify_all();
+    for (const auto& [key, record] : batch) {
+      if (failed_.load(std::memory_order_relaxed)) return;
+      if (!RestoreRecord(directories, root_, key, record)) {
+        std::lock_guard lock(mutex_);
+        failed_ = true;
+        changed_.notify_all();
+        return;
+      }
+    }
+  }
+}
+
+}  // namespace vtr

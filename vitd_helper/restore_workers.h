@@ -1,0 +1,67 @@
+// RestoreWorkers: the records of a manifest laid onto the items beneath a
+// staging root by worker threads, so that restoring a whole device uses
+// every core while the caller reads the next records.
+//
+// Records are taken in batches in the order they were added; each worker
+// keeps the directories of its last record open (OpenDirectoryChain), so
+// records in tree order cost few opens. Every record is resolved beneath
+// the staging root's descriptor without following links and laid onto the
+// item by descriptor (VTRFileMetadata::restoreAttribuesToItemAt). The first
+// record that fails stops the run: workers take no record after it, add()
+// says so, and finish() answers false. Which other records were restored by
+// then is not defined. add() and finish() are called from one thread.
+#ifndef VTR_VITD_HELPER_RESTORE_WORKERS_H_
+#define VTR_VITD_HELPER_RESTORE_WORKERS_H_
+
+#include <atomic>
+#include <condition_variable>
+#include <deque>
+#include <mutex>
+#include <string>
+#include <thread>
+#include <utility>
+#include <vector>
+
+#include "platform/value.h"
+
+namespace vtr {
+
+class RestoreWorkers {
+ public:
+  // stagingDir (the caller's, open for the workers' life) is the directory
+  // of root, the path messages name. At least one worker runs (workers 0,
+  // as hardware_concurrency() may answer, means one).
+  RestoreWorkers(int stagingDir, std::string root, unsigned workers);
+  // Stops the workers after the queued records (as finish does).
+  ~RestoreWorkers();
+  RestoreWorkers(const RestoreWorkers&) = delete;
+  RestoreWorkers& operator=(const RestoreWorkers&) = delete;
+
+  // Queues the record of key (a path beginning with "/" relative to the
+  // staging root); waits while the queue is full. False once a record has
+  // failed: adding more is pointless.
+  bool add(std::string key, Value record);
+  // Waits until every queued record is handled; true when all were
+  // restored. Call once.
+  bool finish();
+
+ private:
+  using Batch = std::vector<std::pair<std::string, Value>>;
+
+  void work();
+  void push(Batch batch);
+
+  const int stagingDir_;
+  const std::string root_;
+  Batch filling_;
+  std::mutex mutex_;
+  std::condition_variable changed_;
+  std::deque<Batch> queue_;
+  bool closed_ = false;
+  std::atomic<bool> failed_{false};
+  std::vector<std::thread> threads_;
+};
+
+}  // namespace vtr
+
+#endif  // VTR_VITD_HELPER_RESTORE_WORKERS_H_
