@@ -144,7 +144,8 @@ bool VTRFileMetadata::restoreAttribuesToItemAt(int dirFd, const std::string& nam
       return SetExtendedAttributeAt(dirFd, name, key, data.data(), data.size());
     });
   }
-  const Dictionary allowed = attributes != nullptr ? fileAttributesAllowSet(*attributes) : Dictionary();
+  static const Dictionary kNone;
+  const Dictionary& all = attributes != nullptr ? *attributes : kNone;
   // Only a regular file or a directory is opened: a device's open could
   // reach its driver, a fifo's block.
   UniqueFd item;
@@ -156,11 +157,11 @@ bool VTRFileMetadata::restoreAttribuesToItemAt(int dirFd, const std::string& nam
     set = Error(S_ISLNK(st.st_mode) ? ELOOP : EOPNOTSUPP, path);
   } else {
     item.reset(::openat(dirFd, name.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
-    set = item ? SetAttributesOfDescriptor(allowed, item.get(), path) : Status(Error::FromErrno(path));
+    set = item ? SetAttributesOfDescriptor(all, item.get(), path, kAllowedToSet) : Status(Error::FromErrno(path));
   }
   if (!set.ok()) {
     VTRLog("Could not set file attributs at %@ with error - %@, attributes = %@", path, set.error(),
-           Value::DictionaryOf(allowed));
+           Value::DictionaryOf(fileAttributesAllowSet(all)));
     return false;
   }
   // The protection class has no Linux counterpart: setting it succeeds

@@ -15,7 +15,9 @@
 
 #include <sys/types.h>
 
+#include <span>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "platform/remove_item.h"  // RemoveItem: recursive removal, links never followed
@@ -115,8 +117,11 @@ Status SetAttributes(const Dictionary& attributes, const std::string& path,
 // do), nothing resolved: a descriptor of another kind fails with
 // EOPNOTSUPP. A regular file with more than one link is never given to an
 // owner or group other than root (EMLINK, nothing changed): the inode lives
-// elsewhere too.
-Status SetAttributesOfDescriptor(const Dictionary& attributes, int fd, const std::string& pathForErrors);
+// elsewhere too. When onlyKeys is not empty, entries under other keys are
+// passed over as if absent (a record's attributes are used as they stand,
+// without a filtered copy).
+Status SetAttributesOfDescriptor(const Dictionary& attributes, int fd, const std::string& pathForErrors,
+                                 std::span<const std::string_view> onlyKeys = {});
 
 // Owner and group of the item at path itself (a symbolic link is changed,
 // not followed). An id of -1 leaves that one as it is.

@@ -5,8 +5,11 @@
 #include <sys/ioctl.h>
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <cmath>
 #include <optional>
+#include <span>
+#include <string_view>
 
 #include "platform/accounts.h"
 #include "platform/file_manager.h"
@@ -37,6 +40,18 @@ struct AttributeChanges {
   bool empty() const { return !changesInode() && !immutable && !appendOnly; }
 };
 
+// The attribute dictionary as the plan reads it: when keys is not empty,
+// an entry under any other key is passed over as if absent.
+struct AttributeLookup {
+  const Dictionary& attributes;
+  std::span<const std::string_view> keys;
+
+  const Value* find(std::string_view key) const {
+    if (!keys.empty() && std::find(keys.begin(), keys.end(), key) == keys.end()) return nullptr;
+    return attributes.find(key);
+  }
+};
+
 Error Invalid(const std::string& path, const char* key, const char* what) {
   return Error(EINVAL, path + ": " + key + " " + what);
 }
@@ -51,7 +66,7 @@ Result<uint32_t> AccountId(const Value& value, const std::string& path, const ch
 
 // The account asked for by name or id; a name that the database knows wins.
 template <typename Lookup>
-Result<std::optional<uint32_t>> ResolveAccount(const Dictionary& attributes, const char* nameKey, const char* idKey,
+Result<std::optional<uint32_t>> ResolveAccount(const AttributeLookup& attributes, const char* nameKey, const char* idKey,
                                                Lookup lookup, const std::string& path) {
   const Value* name = attributes.find(nameKey);
   const Value* id = attributes.find(idKey);
@@ -81,14 +96,14 @@ Result<struct timespec> TimeFromDate(const Value& value, const std::string& path
   return timespec{static_cast<time_t>(seconds), nanoseconds};
 }
 
-Result<std::optional<bool>> Flag(const Dictionary& attributes, const char* key, const std::string& path) {
+Result<std::optional<bool>> Flag(const AttributeLookup& attributes, const char* key, const std::string& path) {
   const Value* value = attributes.find(key);
   if (value == nullptr) return std::optional<bool>();
   if (value->type() != Value::Type::kBoolean && !value->isNumber()) return Invalid(path, key, "is not a boolean");
   return std::optional<bool>(value->boolValue());
 }
 
-Result<AttributeChanges> PlanChanges(const Dictionary& attributes, const std::string& path) {
+Result<AttributeChanges> PlanChanges(const AttributeLookup& attributes, const std::string& path) {
   AttributeChanges changes;
   const std::shared_ptr<const AccountDatabase> accounts = AccountDatabase::Shared();
   auto owner = ResolveAccount(attributes, kNSFileOwnerAccountName, kNSFileOwnerAccountID,
@@ -148,7 +163,7 @@ Status SetFlags(const std::string& path, FileFlags wanted) {
 }  // namespace
 
 Status SetAttributes(const Dictionary& attributes, const std::string& path, LinkAtPath linkAtPath) {
-  Result<AttributeChanges> changes = PlanChanges(attributes, path);
+  Result<AttributeChanges> changes = PlanChanges(AttributeLookup{attributes, {}}, path);
   if (!changes.ok()) return changes.error();
   if (changes->empty()) return Status::Ok();
 
@@ -188,9 +203,10 @@ Status SetAttributes(const Dictionary& attributes, const std::string& path, Link
   return Status::Ok();
 }
 
-Status SetAttributesOfDescriptor(const Dictionary& attributes, int fd, const std::string& pathForErrors) {
+Status SetAttributesOfDescriptor(const Dictionary& attributes, int fd, const std::string& pathForErrors,
+                                 std::span<const std::string_view> onlyKeys) {
   const std::string& path = pathForErrors;
-  Result<AttributeChanges> changes = PlanChanges(attributes, path);
+  Result<AttributeChanges> changes = PlanChanges(AttributeLookup{attributes, onlyKeys}, path);
   if (!changes.ok()) return changes.error();
   if (changes->empty()) return Status::Ok();
   struct statx stx;

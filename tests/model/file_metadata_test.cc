@@ -208,6 +208,22 @@ TEST(FileMetadataTest, OnlySettableAttributesAreRestored) {
   std::vector<std::string> keys;
   for (const auto& entry : filtered) keys.push_back(entry.first);
   EXPECT_EQ(keys, (std::vector<std::string>{kNSFileImmutable, kNSFileOwnerAccountName, kNSFilePosixPermissions}));
+
+  // Laid onto an item, a key the restore does not set is passed over even
+  // when its value could not be used.
+  TempDir dir;
+  WriteFile(dir / "f", "x");
+  const VTRFileMetadata record(Value::DictionaryOf({{kVTRManifestFileAttributes, Value::DictionaryOf({
+                                                         {kNSFilePosixPermissions, Value::Integer(0604)},
+                                                         {kNSFileAppendOnly, Value::String("yes")},
+                                                         {kNSFileType, Value::String(kNSFileTypeRegular)},
+                                                     })}}));
+  UniqueFd folder(::open(dir.path().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  LogCapture log;
+  EXPECT_TRUE(record.restoreAttribuesToItemAt(folder.get(), "f", dir / "f")) << ::testing::PrintToString(log.messages());
+  struct stat st;
+  ASSERT_EQ(::stat((dir / "f").c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 07777, 0604u);
 }
 
 }  // namespace
