@@ -7,7 +7,6 @@ namespace {
 
 using R = VTRHMessageResponder;
 
-// Commands join this table as they are built.
 constexpr std::array kCommands = {
     Command{"migratePreferencesFile:", &R::migratePreferencesFile},
     Command{"prepareLogContainer:", &R::prepareLogContainer},
@@ -17,6 +16,10 @@ constexpr std::array kCommands = {
     Command{"createHardLink:", &R::createHardLink},
     Command{"restoreAttributes:", &R::restoreAttributes},
     Command{"moveStagingToFinal:", &R::moveStagingToFinal},
+    Command{"deleteNvram:", &R::deleteNvram},
+    Command{"writeNvram:", &R::writeNvram},
+    Command{"reboot:", &R::reboot},
+    Command{"quitHelper:", &R::quitHelper},
 };
 
 }  // namespace

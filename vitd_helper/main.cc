@@ -26,7 +26,9 @@ constexpr char kUsage[] =
     "\n"
     "  --root DIR   confine the helper to DIR (chroot): the socket, the log files\n"
     "               and every path a client sends resolve inside DIR; the\n"
-    "               accounts come from DIR/etc/passwd and DIR/etc/group\n"
+    "               accounts come from DIR/etc/passwd and DIR/etc/group; firmware\n"
+    "               variables live in DIR/sys/firmware/efi/efivars, and \"reboot:\"\n"
+    "               restarts only a PID namespace the helper is the first process of\n"
     "  --stderr     send the system-log copy of each message to standard error\n"
     "               instead of syslog\n"
     "  --help       show this text\n";
@@ -98,6 +100,8 @@ int main(int argc, char** argv) {
     return 1;
   }
   VTRHOperations::sharedInstance().setClientAreas(std::move(areas).value());
+  // In a sandbox root "reboot:" may end only the helper's own PID namespace.
+  if (options.root.empty()) VTRHOperations::sharedInstance().setRebootScope(VTRHOperations::RebootScope::kMachine);
 
   VTRLog("%s started", argv[0]);
   (void)logModel.enableLogToFilesUnder("/private/var/logs/vitd", "vitd_helper", 5);

@@ -67,6 +67,12 @@ class VTRHMessageResponder {
   bool createHardLink(const Value& parameter);
   bool restoreAttributes(const Value& parameter);
   bool moveStagingToFinal(const Value& parameter);
+  bool writeNvram(const Value& parameter);
+  bool deleteNvram(const Value& parameter);
+  // Answers only when the reboot cannot be made.
+  bool reboot(const Value& parameter);
+  // Never answers: the process ends.
+  bool quitHelper(const Value& parameter);
 
  private:
   void send(const char* key, XpcObject value);

@@ -90,6 +90,38 @@ class VTRHOperations {
                               const std::optional<std::string>& containerType,
                               const std::optional<std::string>& identifier);
 
+  // The firmware variables (platform/nvram_store.h) in the efivarfs folder
+  // inside the helper's root, looked up by each call and never created:
+  // without it, "Couldn't locate options node in IODeviceTree" and false.
+  //
+  // Sets name to value's UTF-8 bytes (an empty value leaves no variable),
+  // then reads it back and compares, the "sync". A missing or invalid name
+  // or a missing value writes nothing ("Couldn't write nvram"); a read-back
+  // that differs fails with "Couldn't force sync new nvram to device".
+  bool writeNVRam(const std::optional<std::string>& name, const std::optional<std::string>& value);
+  // Removes name; a variable that is not there is already removed. Any
+  // failure, an invalid name included, is logged with the sync message
+  // "Couldn't force sync new nvram to device", as the platform does.
+  bool deleteNvram(const std::optional<std::string>& name);
+
+  // Where a reboot may reach.
+  enum class RebootScope {
+    kMachine,  // the helper serves the machine itself
+    // The helper runs in a sandbox root: it reboots only as the first
+    // process of its own PID namespace, where the kernel ends that
+    // namespace instead of the machine.
+    kOwnPidNamespace,
+  };
+  // kOwnPidNamespace unless the daemon, serving the machine, says otherwise.
+  void setRebootScope(RebootScope scope) { rebootScope_ = scope; }
+  // Flushes the file systems and restarts (the machine, or the PID
+  // namespace, see RebootScope). Returns false only when that cannot be
+  // done, after one log line saying why.
+  bool reboot();
+  // Ends the process with status 0 at once; nothing is cleaned up and no
+  // reply follows. The log's lines are already written.
+  [[noreturn]] void quitHelper();
+
  private:
   // The checked client path, or nullopt after the refusal is logged.
   std::optional<CheckedPath> checkClientPath(const std::string& path, ClientUse use) const;
@@ -98,6 +130,7 @@ class VTRHOperations {
 
   HelperPaths paths_;
   ClientPathResolver resolver_;
+  RebootScope rebootScope_ = RebootScope::kOwnPidNamespace;
 };
 
 }  // namespace vtr

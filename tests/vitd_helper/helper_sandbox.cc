@@ -1,8 +1,11 @@
 #include "tests/vitd_helper/helper_sandbox.h"
 
 #include <fcntl.h>
+#include <sched.h>
 #include <signal.h>
+#include <sys/mount.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -56,14 +59,24 @@ HelperSandbox::~HelperSandbox() {
   ::unlink(logPath_.c_str());
 }
 
-bool HelperSandbox::start() {
+bool HelperSandbox::start(bool ownPidNamespace) {
   const std::string helper = HelperExecutable();
   const std::string root = root_;
   // A socket left by an earlier helper would look like this one's.
   ::unlink(socketPath().c_str());
   const int logFd = ::open(logPath_.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
-  pid_ = ::fork();
+  // clone without a stack behaves as fork; the new namespace is the
+  // child's alone, so this process's later children are not in it.
+  pid_ = ownPidNamespace ? static_cast<pid_t>(::syscall(SYS_clone, CLONE_NEWPID | SIGCHLD, nullptr, nullptr, nullptr,
+                                                        nullptr))
+                         : ::fork();
   if (pid_ == 0) {
+    // In a namespace of its own the helper needs a /proc that shows it:
+    // peers are known by their process ids there.
+    if (ownPidNamespace && (::unshare(CLONE_NEWNS) != 0 || ::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
+                            ::mount("proc", "/proc", "proc", MS_NOSUID | MS_NODEV | MS_NOEXEC, nullptr) != 0)) {
+      ::_exit(126);
+    }
     ::dup2(logFd, STDERR_FILENO);
     const int devnull = ::open("/dev/null", O_RDWR);
     ::dup2(devnull, STDIN_FILENO);
@@ -139,8 +152,7 @@ bool HelperSandbox::running() {
   if (pid_ <= 0) return false;
   int raw = 0;
   if (::waitpid(pid_, &raw, WNOHANG) == 0) return true;
-  exitStatus_ = StatusOf(raw);
-  pid_ = -1;
+  reaped(raw);
   return false;
 }
 
@@ -151,13 +163,18 @@ int HelperSandbox::waitForExit(std::chrono::milliseconds timeout) {
     int raw = 0;
     const pid_t r = ::waitpid(pid_, &raw, WNOHANG);
     if (r == pid_) {
-      pid_ = -1;
-      exitStatus_ = StatusOf(raw);
+      reaped(raw);
       return exitStatus_;
     }
     std::this_thread::sleep_for(std::chrono::milliseconds(10));
   }
   return -1;
+}
+
+void HelperSandbox::reaped(int rawStatus) {
+  pid_ = -1;
+  exitStatus_ = StatusOf(rawStatus);
+  endingSignal_ = WIFSIGNALED(rawStatus) ? WTERMSIG(rawStatus) : 0;
 }
 
 int HelperSandbox::terminate() {

@@ -28,8 +28,10 @@ class HelperSandbox {
   HelperSandbox& operator=(const HelperSandbox&) = delete;
 
   // Starts the helper with --root and --stderr and waits for its socket.
-  // False when it did not come up within a few seconds.
-  bool start();
+  // False when it did not come up within a few seconds. With
+  // ownPidNamespace the helper is the first process (PID 1) of a PID
+  // namespace of its own, where a reboot ends only that namespace.
+  bool start(bool ownPidNamespace = false);
 
   // The host path of a path inside the root ("/private/var/x" ->
   // "<root>/private/var/x").
@@ -55,6 +57,9 @@ class HelperSandbox {
   // Sends SIGTERM and waits for the helper; its exit status (or -1 when it
   // was killed by a signal or did not end in time).
   int terminate();
+  // The signal that ended the helper once it was reaped by a signal; 0
+  // otherwise.
+  int endingSignal() const { return endingSignal_; }
   // Waits up to timeout for the helper to exit by itself; its status or -1.
   int waitForExit(std::chrono::milliseconds timeout);
   bool running();
@@ -69,10 +74,14 @@ class HelperSandbox {
   bool logged(const std::string& line) const;
 
  private:
+  // Records how the helper ended once waitpid gave rawStatus.
+  void reaped(int rawStatus);
+
   std::string root_;
   std::string logPath_;
   pid_t pid_ = -1;
   int exitStatus_ = -1;  // once the helper was reaped
+  int endingSignal_ = 0;
 };
 
 // The vitd_helper and vitdctl executables of this build, and vitdctl built

@@ -7,6 +7,7 @@
 #include <string>
 #include <vector>
 
+#include "tools/vitdctl/nvram_listing.h"
 #include "tools/vitdctl/request.h"
 #include "tools/vitdctl/session.h"
 
@@ -35,6 +36,8 @@ void PrintUsage(FILE* out) {
   item("send FILE|-", "send the request dictionary in FILE: an XML or binary");
   item("", "property list, or JSON (FILE ends in .json or starts with '{')");
   for (const SubCommand& c : SubCommands()) item(std::string(c.name) + (*c.usage ? " " : "") + c.usage, c.summary);
+  item("listNvram [--json]", "print this system's firmware variables (read here, not by the helper;");
+  item("", "with --root, those of DIR/sys/firmware/efi/efivars)");
   std::fprintf(out,
                "\n"
                "Options:\n"
@@ -43,8 +46,10 @@ void PrintUsage(FILE* out) {
                "  --timeout S    seconds to wait for the next message (default 60)\n"
                "  --help         show this text\n"
                "\n"
-               "Exit status: 0 every response true, 1 a response false, 2 no complete answer\n"
-               "(timeout or connection closed), 3 cannot connect, 64 usage error.\n",
+               "Exit status: 0 every response true (reboot and quitHelper: also the helper\n"
+               "closing the connection without a reply), 1 a response false, 2 no complete\n"
+               "answer (timeout or connection closed), 3 cannot connect (listNvram: cannot\n"
+               "read the variables), 64 usage error.\n",
                kDefaultSocket);
 }
 
@@ -92,6 +97,12 @@ int main(int argc, char** argv) {
   const std::string command = argv[optind];
   const std::vector<std::string> args(argv + optind + 1, argv + argc);
   vtr::Result<vtr::XpcObject> request = vtr::Error::Invalid("");
+  if (command == "listNvram") {
+    if (args.size() > 1 || (args.size() == 1 && args[0] != "--json")) UsageError("listNvram takes only --json");
+    if (!socket.empty()) UsageError("listNvram reads the variables here: it takes --root, not --socket");
+    return ListNvram(root, !args.empty(), stdout);
+  }
+  bool endsHelper = false;
   if (command == "send") {
     if (args.size() != 1) UsageError("send takes one FILE (or - for standard input)");
     request = ReadRequestFile(args[0]);
@@ -100,9 +111,11 @@ int main(int argc, char** argv) {
     vtr::Result<vtr::XpcObject> parameter = sub->parameter(args);
     if (!parameter.ok()) UsageError(command + " " + parameter.error().description());
     request = RequestFor(*sub, std::move(parameter).value());
+    endsHelper = sub->endsHelper;
   } else {
     UsageError("unknown command '" + command + "'");
   }
   options.progressBar = ::isatty(STDOUT_FILENO) == 1;
+  options.closeIsSuccess = endsHelper;
   return RunSession(options, *request, stdout);
 }

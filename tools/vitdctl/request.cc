@@ -129,6 +129,16 @@ Result<XpcObject> RestoreParameter(const std::vector<std::string>& args) {
   return XpcObject::Dictionary(std::move(parameter));
 }
 
+Result<XpcObject> NvramWriteParameter(const std::vector<std::string>& args) {
+  if (args.size() != 2) return Error::Invalid("takes NAME and VALUE");
+  return XpcObject::Dictionary({{"Name", XpcObject::String(args[0])}, {"Value", XpcObject::String(args[1])}});
+}
+
+Result<XpcObject> NvramName(const std::vector<std::string>& args) {
+  if (args.size() != 1) return Error::Invalid("takes exactly one NAME");
+  return XpcObject::String(args[0]);
+}
+
 }  // namespace
 
 XpcObject XpcObjectFromValue(const Value& value) {
@@ -196,6 +206,11 @@ const std::vector<SubCommand>& SubCommands() {
        "restore the attributes a signed MANIFEST records (of one container, with TYPE and ID) under STAGING_ROOT",
        RestoreParameter},
       {"moveStagingToFinal", "PATH", "move the staging directory PATH to /var/backup", OnePath},
+      {"writeNvram", "NAME VALUE", "set the firmware variable NAME to VALUE (empty: remove it)",
+       NvramWriteParameter},
+      {"deleteNvram", "NAME", "remove the firmware variable NAME", NvramName},
+      {"reboot", "", "restart the machine (no answer when it does)", NoParameter, true},
+      {"quitHelper", "", "end the helper (it sends no answer)", NoParameter, true},
   };
   return commands;
 }

@@ -34,6 +34,9 @@ struct SubCommand {
   // The request's value from the arguments after the name, or an Error
   // describing the misuse.
   Result<XpcObject> (*parameter)(const std::vector<std::string>& args);
+  // The command ends the helper (or the machine): the connection closing
+  // without a reply is its success.
+  bool endsHelper = false;
 };
 
 // Every sub-command, in the order --help lists them.

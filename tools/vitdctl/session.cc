@@ -82,6 +82,10 @@ int RunSession(const SessionOptions& options, const XpcObject& request, FILE* ou
     if (!message.ok()) {
       if (barShown) std::fputc('\n', out);
       const bool timedOut = message.error().code() == ETIMEDOUT;
+      if (options.closeIsSuccess && !timedOut && responses == 0) {
+        std::fprintf(stderr, "vitdctl: the helper ended the connection without a reply, as this command does\n");
+        return kAllTrue;
+      }
       std::fprintf(stderr, "vitdctl: %s after %zu of %zu responses\n",
                    timedOut ? "no answer in time" : "the helper closed the connection", responses, expected);
       return kIncomplete;

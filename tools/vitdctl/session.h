@@ -26,6 +26,9 @@ struct SessionOptions {
   std::chrono::milliseconds timeout{60000};
   // Draw "Progress" as a bar on this terminal instead of printing JSON lines.
   bool progressBar = false;
+  // The request ends the helper: the connection closing before a reply is
+  // its success (a reply still counts as the helper gives it).
+  bool closeIsSuccess = false;
 };
 
 // Sends request and prints each message received as one line of JSON to out
