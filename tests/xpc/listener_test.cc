@@ -241,10 +241,15 @@ TEST(ListenerTest, ClientsThatStopReadingDelayNobodyAndAreDroppedOnTime) {
   const auto asked = std::chrono::steady_clock::now();
   ExpectServed(server.path());
   EXPECT_LT(std::chrono::steady_clock::now() - asked, std::chrono::milliseconds(1000));
-  // Each is dropped once its output has not moved for the send timeout.
-  ASSERT_TRUE(server.waitUntil([](TestServer& s) { return s.invalidReasons.size() == 10; }));
+  // Each is dropped once its output has not moved for the send timeout
+  // (the served client's own end is among the reasons too, at any moment).
+  const auto dropped = [](const TestServer& s) {
+    return std::count_if(s.invalidReasons.begin(), s.invalidReasons.end(),
+                         [](const std::string& reason) { return reason.find("stopped reading") != std::string::npos; });
+  };
+  ASSERT_TRUE(server.waitUntil([&](TestServer& s) { return dropped(s) >= 10; }));
   EXPECT_GE(std::chrono::steady_clock::now() - asked, std::chrono::milliseconds(1500));
-  EXPECT_TRUE(AnyReasonContains(server, "stopped reading"));
+  EXPECT_TRUE(server.waitUntil([&](TestServer& s) { return dropped(s) == 10; }));
 }
 
 TEST(ListenerTest, ConnectionsOfOneUserAreCappedAndUntrustedOnesExpire) {
