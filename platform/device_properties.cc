@@ -1,6 +1,7 @@
 #include "platform/device_properties.h"
 
 #include <fcntl.h>
+#include <sys/statvfs.h>
 #include <unistd.h>
 
 #include "platform/read_fully.h"
@@ -18,6 +19,14 @@ std::optional<bool> SigningFuse(const std::string& efivarsFolder, int rootFd) {
   const unsigned char value = static_cast<unsigned char>((*bytes)[4]);
   if (value > 1) return std::nullopt;
   return value == 1;
+}
+
+std::optional<Value> DiskUsage(const std::string& dataVolume) {
+  struct statvfs st;
+  if (::statvfs(dataVolume.c_str(), &st) != 0) return std::nullopt;
+  const auto bytes = [&](uint64_t blocks) { return Value::Integer(static_cast<int64_t>(blocks * st.f_frsize)); };
+  return Value::DictionaryOf({{kDiskUsageTotalDataCapacity, bytes(st.f_blocks)},
+                              {kDiskUsageTotalDataAvailable, bytes(st.f_bavail)}});
 }
 
 }  // namespace vtr

@@ -8,6 +8,8 @@
 #include <optional>
 #include <string>
 
+#include "platform/value.h"
+
 namespace vtr {
 
 inline constexpr char kEfiVariablesFolder[] = "/sys/firmware/efi/efivars";
@@ -20,6 +22,14 @@ inline constexpr char kEfiVariablesFolder[] = "/sys/firmware/efi/efivars";
 // The folder is an absolute path resolved beneath rootFd (AT_FDCWD: as it
 // stands).
 std::optional<bool> SigningFuse(const std::string& efivarsFolder = kEfiVariablesFolder, int rootFd = AT_FDCWD);
+
+// "DiskUsage": a dictionary of the data volume's numbers in bytes, from
+// statvfs of dataVolume: kDiskUsageTotalDataCapacity = f_blocks x f_frsize,
+// kDiskUsageTotalDataAvailable = f_bavail x f_frsize (what an unprivileged
+// writer may still use). No answer when the volume cannot be asked.
+inline constexpr char kDiskUsageTotalDataCapacity[] = "TotalDataCapacity";
+inline constexpr char kDiskUsageTotalDataAvailable[] = "TotalDataAvailable";
+std::optional<Value> DiskUsage(const std::string& dataVolume = "/private/var");
 
 }  // namespace vtr
 

@@ -20,6 +20,8 @@ constexpr std::array kCommands = {
     Command{"writeNvram:", &R::writeNvram},
     Command{"reboot:", &R::reboot},
     Command{"quitHelper:", &R::quitHelper},
+    Command{"shrinkDataPartition:", &R::shrinkDataPartition},
+    Command{"expandDataPartition:", &R::expandDataPartition},
 };
 
 }  // namespace

@@ -1,4 +1,5 @@
 // vitd_helper: the demo-mode privileged helper daemon.
+#include <fcntl.h>
 #include <getopt.h>
 
 #include <cstdio>
@@ -11,6 +12,7 @@
 #include "vitd_helper/client_areas.h"
 #include "vitd_helper/message_responder.h"
 #include "vitd_helper/operations.h"
+#include "vitd_helper/partition_resize.h"
 #include "vitd_helper/sandbox.h"
 #include "vitd_helper/service.h"
 #include "xpc/peer_identity.h"
@@ -108,6 +110,11 @@ int main(int argc, char** argv) {
 
   VTRProgressUpdater::sharedInstance().setSender(
       [](int64_t percent) { VTRHMessageResponder::sharedInstance().sendProgress(percent); });
+
+  // The data-partition commands read the mount table through /proc too.
+  DataPartitionDisk disk;
+  disk.procDirectory = std::make_shared<const UniqueFd>(::fcntl(proc->get(), F_DUPFD_CLOEXEC, 0));
+  SetDataPartitionDisk(std::move(disk));
 
   HelperService service(std::move(proc).value());
   return service.run();

@@ -73,6 +73,8 @@ class VTRHMessageResponder {
   bool reboot(const Value& parameter);
   // Never answers: the process ends.
   bool quitHelper(const Value& parameter);
+  bool shrinkDataPartition(const Value& parameter);
+  bool expandDataPartition(const Value& parameter);
 
  private:
   void send(const char* key, XpcObject value);

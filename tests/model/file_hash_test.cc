@@ -9,7 +9,7 @@
 
 #include <gtest/gtest.h>
 
-#include "tests/model/failing_syscall.h"
+#include "tests/support/failing_syscall.h"
 #include "tests/support/test_support.h"
 
 namespace vtr {

@@ -13,7 +13,7 @@
 #include "platform/accounts.h"
 #include "platform/file_manager.h"
 #include "platform/unique_fd.h"
-#include "tests/model/failing_syscall.h"
+#include "tests/support/failing_syscall.h"
 #include "tests/support/test_support.h"
 
 namespace vtr {

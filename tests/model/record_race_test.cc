@@ -19,7 +19,7 @@
 #include "platform/accounts.h"
 #include "platform/file_manager.h"
 #include "platform/file_tree.h"
-#include "tests/model/failing_syscall.h"
+#include "tests/support/failing_syscall.h"
 #include "tests/support/test_support.h"
 
 namespace vtr {

@@ -1,19 +1,17 @@
 #include "platform/block_geometry.h"
 
 #include <fcntl.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
 
-#include <array>
-#include <cstdio>
 #include <string>
 
 #include "platform/unique_fd.h"
 #include "storage/zarn_acquire.h"
 #include "storage/zarn_header.h"
 #include "tests/storage/zarn_test_support.h"
+#include "tests/support/loop_device.h"
 #include "tests/support/test_support.h"
 
 namespace vtr {
@@ -47,38 +45,6 @@ TEST(BlockGeometryTest, OtherDescriptorsFailLikeTheRequest) {
   EXPECT_EQ(BlockSizeOf(-1).error().code(), EBADF);
 }
 
-// Runs a command line; its exit status (or -1).
-int Run(const std::string& command, std::string* output = nullptr) {
-  FILE* pipe = ::popen((command + " 2>/dev/null").c_str(), "r");
-  if (pipe == nullptr) return -1;
-  std::array<char, 256> buffer;
-  std::string text;
-  while (std::fgets(buffer.data(), buffer.size(), pipe) != nullptr) text += buffer.data();
-  const int status = ::pclose(pipe);
-  if (output != nullptr) *output = text;
-  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
-}
-
-// A loop device over a file, detached when the object goes away.
-class LoopDevice {
- public:
-  LoopDevice(const std::string& file, uint32_t blockSize) {
-    std::string out;
-    if (Run("losetup -f --show -b " + std::to_string(blockSize) + " " + file, &out) == 0 && !out.empty()) {
-      path_ = out.substr(0, out.find('\n'));
-    }
-  }
-  ~LoopDevice() {
-    if (!path_.empty()) Run("losetup -d " + path_);
-  }
-  LoopDevice(const LoopDevice&) = delete;
-  LoopDevice& operator=(const LoopDevice&) = delete;
-  const std::string& path() const { return path_; }
-
- private:
-  std::string path_;
-};
-
 TEST(BlockGeometryTest, LoopDeviceGeometryAndHeader) {
   if (!testing::IsRoot()) GTEST_SKIP() << "needs root to attach a loop device";
   testing::TempDir dir;
@@ -88,7 +54,7 @@ TEST(BlockGeometryTest, LoopDeviceGeometryAndHeader) {
     ASSERT_TRUE(fd.valid());
     ASSERT_EQ(::ftruncate(fd.get(), 64 << 20), 0);
   }
-  LoopDevice loop(file, 4096);
+  testing::LoopDevice loop(file, 4096);
   if (loop.path().empty()) GTEST_SKIP() << "losetup could not attach a loop device";
 
   UniqueFd device = OpenFile(loop.path(), O_RDWR);

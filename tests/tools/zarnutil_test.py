@@ -181,6 +181,50 @@ class ZarnutilTest(unittest.TestCase):
             result = run("--block-size", size, "create", self.image)
             self.assertEqual((result.returncode, result.stderr), (1, message))
 
+    def gpt_disk(self, entries, blocks=65536, signed=True):
+        """A 4096-byte-block disk image with a GPT of entries (name, first, count) and both copies."""
+        bs, first_usable, last_usable, disk_guid = 4096, 256, blocks - 3, uuid.uuid4().bytes_le
+        table = b"".join(uuid.uuid4().bytes_le + uuid.uuid4().bytes_le + struct.pack("<QQQ", f, f + n - 1, 0) +
+                         name.encode("utf-16-le").ljust(72, b"\0") for name, f, n in entries)
+        def header(my, alternate, table_lba):
+            h = bytearray(struct.pack("<8sIIIIQQQQ16sQIII", b"EFI PART", 0x10000, 92, 0, 0, my, alternate,
+                                      first_usable, last_usable, disk_guid, table_lba, len(entries),
+                                      128, zlib.crc32(table)))
+            struct.pack_into("<I", h, 16, zlib.crc32(bytes(h)))
+            return bytes(h)
+        with open(self.image, "r+b") as f:
+            f.truncate(blocks * bs)
+            f.seek(440)
+            f.write(b"nraZ" if signed else b"\0\0\0\0")
+            for offset, data in ((bs, header(1, blocks - 1, 2)), (2 * bs, table), ((last_usable + 1) * bs, table),
+                                 ((blocks - 1) * bs, header(blocks - 1, 1, last_usable + 1))):
+                f.seek(offset)
+                f.write(data)
+
+    def test_disk_shows_what_the_resize_sees(self):
+        self.gpt_disk([("System", 256, 4096), ("Data", 8448, 16384), ("Update", 4352, 4096)])
+        result = run("disk", self.image, "--json")
+        self.assertEqual(result.returncode, 0, result.stderr)
+        disk = json.loads(result.stdout)
+        self.assertTrue(disk["zarnSignature"])
+        self.assertTrue(disk["gptValid"])
+        self.assertEqual([(e["name"], e["first"], e["blocks"], e["data"]) for e in disk["entries"]],
+                         [("System", 256, 4096, False), ("Data", 8448, 16384, True), ("Update", 4352, 4096, False)])
+        self.assertEqual(disk["freeBlocks"], (65533 - 256 + 1) - 4096 - 16384 - 4096)
+        self.assertNotIn("dataFileSystem", disk)
+        text = run("disk", self.image).stdout
+        self.assertIn("<- Data", text)
+        self.assertIn("Data is not mounted", text)
+        # A table byte changed behind the CRC; no signature.
+        with open(self.image, "r+b") as f:
+            f.seek(2 * 4096 + 40)
+            f.write(b"\x01")
+            f.seek(440)
+            f.write(b"\0\0\0\0")
+        disk = json.loads(run("disk", self.image, "--json").stdout)
+        self.assertFalse(disk["gptValid"])
+        self.assertFalse(disk["zarnSignature"])
+
     def test_usage(self):
         self.assertEqual(run("--help").returncode, 0)
         self.assertIn("usage: zarnutil", run("--help").stdout)

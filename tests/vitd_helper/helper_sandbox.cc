@@ -77,6 +77,7 @@ bool HelperSandbox::start(bool ownPidNamespace) {
                             ::mount("proc", "/proc", "proc", MS_NOSUID | MS_NODEV | MS_NOEXEC, nullptr) != 0)) {
       ::_exit(126);
     }
+    if (failing_ && !failing_->install()) ::_exit(125);
     ::dup2(logFd, STDERR_FILENO);
     const int devnull = ::open("/dev/null", O_RDWR);
     ::dup2(devnull, STDIN_FILENO);

@@ -8,9 +8,11 @@
 #include <sys/types.h>
 
 #include <chrono>
+#include <optional>
 #include <string>
 #include <vector>
 
+#include "tests/support/failing_syscall.h"
 #include "xpc/xpc_object.h"
 
 namespace vtr::testing {
@@ -32,6 +34,10 @@ class HelperSandbox {
   // ownPidNamespace the helper is the first process (PID 1) of a PID
   // namespace of its own, where a reboot ends only that namespace.
   bool start(bool ownPidNamespace = false);
+  // Makes the system calls numbers fail with error in the helper started
+  // next (a seccomp filter installed before it executes): a fault a real
+  // disk does not offer on demand.
+  void failSyscalls(const std::vector<long>& numbers, int error) { failing_.emplace(numbers, error); }
 
   // The host path of a path inside the root ("/private/var/x" ->
   // "<root>/private/var/x").
@@ -79,6 +85,7 @@ class HelperSandbox {
 
   std::string root_;
   std::string logPath_;
+  std::optional<FailingSyscalls> failing_;
   pid_t pid_ = -1;
   int exitStatus_ = -1;  // once the helper was reaped
   int endingSignal_ = 0;

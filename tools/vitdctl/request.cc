@@ -211,6 +211,8 @@ const std::vector<SubCommand>& SubCommands() {
       {"deleteNvram", "NAME", "remove the firmware variable NAME", NvramName},
       {"reboot", "", "restart the machine (no answer when it does)", NoParameter, true},
       {"quitHelper", "", "end the helper (it sends no answer)", NoParameter, true},
+      {"shrinkDataPartition", "", "give half of the data volume's free space back to the disk", NoParameter},
+      {"expandDataPartition", "", "grow the data partition over every block the others leave free", NoParameter},
   };
   return commands;
 }

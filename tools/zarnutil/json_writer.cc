@@ -96,6 +96,11 @@ void JsonWriter::number(uint64_t value) {
   out_ += std::to_string(value);
 }
 
+void JsonWriter::boolean(bool value) {
+  beforeValue();
+  out_ += value ? "true" : "false";
+}
+
 void JsonWriter::string(std::string_view utf8) {
   beforeValue();
   out_ += JsonQuote(utf8);

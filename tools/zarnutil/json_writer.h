@@ -21,6 +21,7 @@ class JsonWriter {
   void key(std::string_view name);
   void number(uint64_t value);
   void string(std::string_view utf8);
+  void boolean(bool value);
 
   // The text written so far.
   const std::string& text() const { return out_; }

@@ -6,6 +6,7 @@
 #include <string_view>
 
 #include "tools/zarnutil/commands.h"
+#include "tools/zarnutil/disk_report.h"
 
 namespace {
 
@@ -23,6 +24,9 @@ constexpr char kUsage[] =
     "                          --strict fails on a fault and writes nothing\n"
     "  export IMAGE [--json]   print the partitions with their extents\n"
     "  map IMAGE               draw the chunk map (32 x 32, one mark a chunk)\n"
+    "  disk DISK [--json]      the boot disk as the data-partition resize sees\n"
+    "                          it: signature, GPT copies, entries, free blocks,\n"
+    "                          the file system mounted from \"Data\"\n"
     "\n"
     "options:\n"
     "  --block-size N          block size of an image file (default 4096);\n"
@@ -41,6 +45,7 @@ constexpr Command kCommands[] = {
     {"create", nullptr, vtr::RunCreate}, {"show", "--json", vtr::RunShow},
     {"check", nullptr, vtr::RunCheck},   {"repair", "--strict", vtr::RunRepair},
     {"export", "--json", vtr::RunExport}, {"map", nullptr, vtr::RunMap},
+    {"disk", "--json", vtr::RunDisk},
 };
 
 int UsageError(const std::string& problem) {

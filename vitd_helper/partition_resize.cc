@@ -1,0 +1,348 @@
+#include "vitd_helper/partition_resize.h"
+
+#include <fcntl.h>
+#include <sys/file.h>
+#include <sys/stat.h>
+#include <unistd.h>
+#include <uuid/uuid.h>
+
+#include <array>
+#include <chrono>
+#include <cstring>
+#include <optional>
+#include <thread>
+#include <vector>
+
+#include "model/log.h"
+#include "platform/block_geometry.h"
+#include "platform/device_properties.h"
+#include "storage/file_system_resize.h"
+#include "storage/gpt_disk.h"
+#include "storage/little_endian.h"
+#include "storage/mount_table.h"
+#include "storage/zarn_adjust.h"
+#include "storage/zarn_geometry.h"
+#include "storage/zarn_layout.h"
+
+namespace vtr {
+namespace {
+
+DataPartitionDisk& Disk() {
+  static DataPartitionDisk disk;
+  return disk;
+}
+
+// The partitions the resize knows by name; only "Data" is resized.
+constexpr std::array<const char*, 3> kPartitionNames = {"System", "Data", "Update"};
+constexpr size_t kDataRow = 1;
+
+// How long the table write waits for a writer holding the disk's lock.
+constexpr auto kLockPatience = std::chrono::seconds(2);
+
+struct GptRead {
+  GptImage image;
+  ZarnMediaProperties props;
+  uint64_t blockCount = 0;
+  // The table position of each name of kPartitionNames, -1 when absent.
+  std::array<int, kPartitionNames.size()> positions{-1, -1, -1};
+
+  uint32_t entryCount() const { return image.entryCount(); }
+  // Entries the table can hold of those the header counts.
+  uint32_t tableEntries() const { return std::min<uint32_t>(entryCount(), kGptTableEntries); }
+  uint64_t blocksOf(uint32_t i) const { return image.lastLba(i) - image.firstLba(i) + 1; }
+};
+
+// The raw device opened with flags, or -1 after a message.
+int OpenRawDevice(int flags) {
+  const char* path = Disk().rawDevice.c_str();
+  const int fd = ::open(path, flags | O_CLOEXEC);
+  if (fd < 0) {
+    VTRLog("failed to open %s", path);
+    return -1;
+  }
+  struct stat st;
+  if (::fstat(fd, &st) != 0) {
+    VTRLog("failed to stat %s", path);
+    ::close(fd);
+    return -1;
+  }
+  // A block device of the whole disk, or a disk image.
+  if (!S_ISBLK(st.st_mode) && !S_ISREG(st.st_mode)) {
+    VTRLog("%s is not a suitable device (try /dev/rdisk*)", path);
+    ::close(fd);
+    return -1;
+  }
+  return fd;
+}
+
+bool ReadGpt(GptRead* gpt) {
+  const char* path = Disk().rawDevice.c_str();
+  const int fd = OpenRawDevice(O_RDONLY);
+  if (fd < 0) return false;
+  UniqueFd closer(fd);
+  Result<uint32_t> blockSize = BlockSizeOf(fd);
+  if (!blockSize.ok()) {
+    VTRLog("ioctl DKIOCGETBLOCKSIZE failed");
+    return false;
+  }
+  Result<uint64_t> blockCount = BlockCountOf(fd);
+  if (!blockCount.ok()) {
+    VTRLog("ioctl DKIOCGETBLOCKCOUNT failed");
+    return false;
+  }
+  if (zarnInitMediaGeometry(&gpt->props, *blockCount * *blockSize, *blockSize) != 0) {
+    VTRLog("Device %s not suitable", path);
+    return false;
+  }
+  gpt->blockCount = *blockCount;
+  Result<bool> signature = ReadZarnSignature(fd, *blockSize);
+  if (!signature.ok()) {
+    VTRLog("Failed to read MBR from %s", path);
+    return false;
+  }
+  if (!*signature) {
+    VTRLog("%s not managed by Zarn", path);
+    return false;
+  }
+  Result<GptImage> image = ReadGptImage(fd, *blockSize);
+  if (!image.ok()) {
+    VTRLog("Failed to read GPT header and table from %s", path);
+    return false;
+  }
+  gpt->image = *image;
+  for (size_t row = 0; row < kPartitionNames.size(); ++row) gpt->positions[row] = gpt->image.positionOf(kPartitionNames[row]);
+  return true;
+}
+
+struct MountedData {
+  std::string mountPoint;
+  std::string source;
+};
+
+// The mounted file system whose partition entry carries uuidText.
+std::optional<MountedData> FindMountedFileSystem(const std::string& uuidText) {
+  std::vector<MountEntry> mounts;
+  Result<std::vector<MountEntry>> table =
+      Disk().procDirectory ? ReadMountTable(Disk().procDirectory->get()) : Error(ENOENT, "no proc directory");
+  if (table.ok()) {
+    mounts = std::move(*table);
+  } else {
+    VTRLog("failed to get filesystem information");
+  }
+  VTRLog("scanning %d filesystems for %s", table.ok() ? static_cast<int>(mounts.size()) : -1, uuidText);
+  uuid_t wanted;
+  uuid_parse(uuidText.c_str(), wanted);
+  for (const MountEntry& mount : mounts) {
+    if (mount.source.rfind("/dev/", 0) != 0) continue;  // no partition beneath it
+    const std::string bsdName = mount.source.substr(mount.source.rfind('/') + 1);
+    Result<std::string> uuid = PartitionUuidOf(mount.source);
+    if (!uuid.ok()) {
+      if (uuid.error().code() == ENOENT) {
+        VTRLog("device matching %s has no UUID (unexpected)", bsdName);
+      } else {
+        VTRLog("failed to find an IOService owning %s (unexpected)", bsdName);
+      }
+      continue;
+    }
+    uuid_t found;
+    if (uuid_parse(uuid->c_str(), found) != 0) {
+      VTRLog("failed to get string from UUID property (unexpected)");
+      continue;
+    }
+    const bool match = uuid_compare(found, wanted) == 0;
+    VTRLog("UUID %s %smatch", *uuid, match ? "" : "does not ");
+    if (match) {
+      VTRLog("matched %s on %s", mount.source, mount.mountPoint);
+      return MountedData{mount.mountPoint, mount.source};
+    }
+  }
+  return std::nullopt;
+}
+
+// Resizes the file system mounted at mountPoint; 0, or 1 after its message.
+int HfsResize(const std::string& mountPoint, uint64_t newBytes) {
+  Status resized = ResizeMountedFileSystem(mountPoint, newBytes);
+  if (resized.ok()) return 0;
+  // A refusal the helper can explain is said in words first.
+  if (resized.error().code() == EOPNOTSUPP || resized.error().code() == EPERM) {
+    VTRLog("%s", resized.error().message());
+  }
+  VTRLog("HFS resize failed. errno=%d", resized.error().code());
+  return 1;
+}
+
+// The raw device opened for writing with the shared lock partitioning tools
+// respect; a writer holding the disk exclusively makes it fail, after a
+// short wait, rather than block.
+int OpenRawDeviceLocked() {
+  const int fd = OpenRawDevice(O_RDWR);
+  if (fd < 0) return -1;
+  const auto deadline = std::chrono::steady_clock::now() + kLockPatience;
+  while (::flock(fd, LOCK_SH | LOCK_NB) != 0) {
+    if (errno != EWOULDBLOCK || std::chrono::steady_clock::now() > deadline) {
+      ::close(fd);
+      return -1;
+    }
+    std::this_thread::sleep_for(std::chrono::milliseconds(50));
+  }
+  return fd;
+}
+
+// Index of an entry other than which whose start the new layout moves, or -1.
+int MovedEntry(const GptImage& before, const GptImage& after, uint32_t which) {
+  for (uint32_t i = 0; i < std::min<uint32_t>(before.entryCount(), kGptTableEntries); ++i) {
+    if (i != which && before.firstLba(i) != after.firstLba(i)) return static_cast<int>(i);
+  }
+  return -1;
+}
+
+// One number of the "DiskUsage" answer; 0 when it is missing.
+int64_t DiskUsageNumber(const Value& answer, const char* key) {
+  return answer.get(key).integer().value_or(0);
+}
+
+}  // namespace
+
+void SetDataPartitionDisk(DataPartitionDisk disk) { Disk() = std::move(disk); }
+
+int ShrinkDataPartition() {
+  std::optional<Value> usage = DiskUsage(Disk().dataVolume);
+  if (!usage) {
+    VTRLog("Cannot get disk usage.");
+    return -1;
+  }
+  const int64_t freeSize = DiskUsageNumber(*usage, kDiskUsageTotalDataAvailable);
+  const int64_t totalSize = DiskUsageNumber(*usage, kDiskUsageTotalDataCapacity);
+  const int64_t newSize = totalSize - freeSize / 2;
+  VTRLog("freeSize = %lld(bytes), totalSize = %lld(bytes), newSize = %lld(bytes)\n\n", freeSize, totalSize, newSize);
+  return adjust_partition(static_cast<uint64_t>(newSize)) == 0 ? 0 : -1;
+}
+
+int ExpandDataPartition() {
+  GptRead gpt;
+  int64_t blocks = 0;
+  if (ReadGpt(&gpt)) {
+    const int64_t first = static_cast<int64_t>(gpt.image.firstUsableLba());
+    const int64_t last = static_cast<int64_t>(gpt.image.lastUsableLba());
+    VTRLog("gpt.pth.first_lba = %lld, last_lba = %lld", first, last);
+    blocks = last - first + 1;
+    for (uint32_t i = 0; i < gpt.tableEntries(); ++i) {
+      const int64_t size = static_cast<int64_t>(gpt.blocksOf(i));
+      VTRLog("Partition %d: first = %lld, last = %lld, lbaNumber = %lld", static_cast<int>(i),
+             static_cast<int64_t>(gpt.image.firstLba(i)), static_cast<int64_t>(gpt.image.lastLba(i)), size);
+      // The data partition is expected at table position 1.
+      if (i != 1) blocks -= size;
+    }
+  }
+  VTRLog("Block numbers that could be used as data partition = %lld", blocks);
+  const int64_t newSize = blocks * static_cast<int64_t>(gpt.props.blockSize);
+  VTRLog("newSize = %lld(bytes)", newSize);
+  return adjust_partition(static_cast<uint64_t>(newSize));
+}
+
+int adjust_partition(uint64_t requiredSize) {
+  VTRLog("entering %s", "adjust_partition");
+  GptRead gpt;
+  if (!ReadGpt(&gpt)) return 1;
+  const uint32_t count = gpt.entryCount();
+  const uint32_t which = gpt.positions[kDataRow] >= 0 ? static_cast<uint32_t>(gpt.positions[kDataRow]) : count;
+  const uint32_t blockSize = gpt.props.blockSize;
+  const uint64_t blocks = requiredSize / blockSize + (requiredSize % blockSize != 0 ? 1 : 0);
+  VTRLog("partition: requiredSize=%llu", blocks);
+
+  // Does it fit? Silent when it does not.
+  uint64_t sum = which == count ? blocks : 0;
+  for (uint32_t i = 0; i < gpt.tableEntries(); ++i) sum += i == which ? blocks : gpt.blocksOf(i);
+  if (sum > gpt.image.lastUsableLba() - gpt.image.firstUsableLba() + 1) return 1;
+
+  if (blocks == 0) {
+    VTRLog("deletion of partition %d disallowed", 1);
+    return 1;
+  }
+  if (which < count && blocks == gpt.blocksOf(which)) {
+    VTRLog("no change in size");
+    return 0;
+  }
+  const char* verb = which == count ? "create" : "adjust";
+  if (which > 7 || which > count) {
+    VTRLog("bad partion number");
+    VTRLog("failed to %s partition %d", verb, static_cast<int>(which));
+    return 1;
+  }
+
+  std::optional<MountedData> mounted;
+  if (which < count) mounted = FindMountedFileSystem(gpt.image.uuidOf(which));
+  if (!mounted && which < count) {
+    VTRLog("filesystem must be mounted (mountPoint=%s,which=%d,nPartitions=%d,newSize=%llu)",
+           static_cast<const char*>(nullptr), static_cast<int>(which), static_cast<int>(count), blocks);
+    VTRLog("failed to %s partition %d", verb, static_cast<int>(which));
+    return 1;
+  }
+  const uint64_t newBytes = blocks * blockSize;
+  const uint64_t currentBytes = which < count ? gpt.blocksOf(which) * blockSize : 0;
+
+  // The new layout, worked out before anything changes: a failure or a
+  // layout that moves another partition's start (its data would stay where
+  // it is) stops here, with the file system untouched.
+  GptImage adjusted = gpt.image;
+  if (zarnAdjustPartition(&gpt.props, adjusted.header.data(), adjusted.table.data(), which, newBytes) != 0) {
+    VTRLog("adjustment failed");
+    VTRLog("failed to %s partition %d", verb, static_cast<int>(which));
+    return 1;
+  }
+  if (const int moved = MovedEntry(gpt.image, adjusted, which); moved >= 0) {
+    VTRLog("the new layout would move the start of partition %d, whose data would not move with it", moved);
+    VTRLog("failed to %s partition %d", verb, static_cast<int>(which));
+    return 1;
+  }
+
+  if (mounted && newBytes < currentBytes) {
+    VTRLog("shrinking HFS filesystem on %s from %llu to %llu", mounted->mountPoint, currentBytes, newBytes);
+    if (HfsResize(mounted->mountPoint, newBytes) != 0) {
+      VTRLog("can't shrink partition %d, currently mounted on %s", static_cast<int>(which), mounted->mountPoint);
+      VTRLog("failed to %s partition %d", verb, static_cast<int>(which));
+      return 1;
+    }
+  }
+  if (which == count) {
+    VTRLog("Creating new partition instead of adjusting existing one");
+  } else {
+    VTRLog("Resizing existing partition with GPT index %d", static_cast<int>(which));
+  }
+  VTRLog("About to adjust with settings partitionIndex:%d size:%llu MB", static_cast<int>(which), newBytes >> 20);
+
+  const char* path = Disk().rawDevice.c_str();
+  const int fd = OpenRawDeviceLocked();
+  if (fd < 0) {
+    VTRLog("Failed to open %s to write new GPT header out to disk.\n", path);
+    return 1;
+  }
+  UniqueFd closer(fd);
+  if (Status written = WriteGptWithBackup(fd, blockSize, gpt.blockCount, adjusted); !written.ok()) {
+    const int error = written.error().code();
+    VTRLog("failed to write GPT header and table to %s (return %d). errno=%d : %s", path, -1, error,
+           std::strerror(error));
+    return 1;
+  }
+  VTRLog("Wrote GPT header back to disk");
+  const uint64_t first = adjusted.firstLba(which);
+  const uint64_t length = (adjusted.lastLba(which) - first + 1) * blockSize;
+  Status told = TellKernelPartition(fd, static_cast<int>(which) + 1, first * blockSize, length, which == count);
+  closer.reset();
+  ::sync();
+  if (!told.ok()) {
+    VTRLog("Could not tell the kernel the new size of partition %d: %@", static_cast<int>(which) + 1, told.error());
+    return 1;
+  }
+
+  if (mounted && currentBytes <= newBytes) {
+    VTRLog("expanding HFS filesystem on %s to %llu", mounted->mountPoint, newBytes);
+    if (HfsResize(mounted->mountPoint, newBytes) != 0) {
+      VTRLog("can't expanding HFS filesystem on %s", mounted->mountPoint);
+      return 1;
+    }
+  }
+  return 0;
+}
+
+}  // namespace vtr
