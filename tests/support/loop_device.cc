@@ -1,9 +1,13 @@
 #include "tests/support/loop_device.h"
 
+#include <fcntl.h>
+#include <sys/file.h>
 #include <sys/wait.h>
 
 #include <array>
 #include <cstdio>
+
+#include "platform/unique_fd.h"
 
 namespace vtr::testing {
 
@@ -19,6 +23,10 @@ int RunCommand(const std::string& command, std::string* output) {
 }
 
 LoopDevice::LoopDevice(const std::string& file, uint32_t blockSize) {
+  // Tests run in parallel: finding a free device and attaching it is done
+  // by one of them at a time.
+  UniqueFd lock(::open("/tmp/vtr-loop-devices.lock", O_RDWR | O_CREAT | O_CLOEXEC, 0600));
+  if (lock) ::flock(lock.get(), LOCK_EX);
   std::string out;
   if (RunCommand("losetup -f --show -b " + std::to_string(blockSize) + " " + file, &out) == 0 && !out.empty()) {
     path_ = out.substr(0, out.find('\n'));

@@ -65,6 +65,20 @@ std::map<std::string, Entry> Dump(const std::string& device) {
   return entries;
 }
 
+// sfdisk's header lines: the disk's GUID, the usable range, the table's
+// length.
+std::string DumpHeader(const std::string& device) {
+  std::string text, header;
+  RunCommand("sfdisk --dump " + device, &text);
+  std::istringstream lines(text);
+  for (std::string l; std::getline(lines, l);) {
+    for (const char* key : {"label-id:", "first-lba:", "last-lba:", "table-length:"}) {
+      if (l.rfind(key, 0) == 0) header += l + "\n";
+    }
+  }
+  return header;
+}
+
 uint64_t SysfsNumber(const std::string& path) {
   const std::string text = ReadFile(path);
   return text.empty() ? 0 : std::stoull(text);
@@ -127,7 +141,8 @@ class DataPartitionTest : public ::testing::Test {
     }
     if (dataNumber_ > 0) {
       const std::string data = loop_->partition(dataNumber_);
-      EXPECT_EQ(RunCommand("mkfs." + fsType + (fsType == "btrfs" ? " -q -f " : " -q -F ") + data), 0) << fsType;
+      // Each mkfs forces its own way over what may be on the partition.
+      EXPECT_EQ(RunCommand("mkfs." + fsType + (fsType == "ext4" ? " -q -F " : " -q -f ") + data), 0) << fsType;
       if (mount) {
         EXPECT_EQ(::mount(data.c_str(), sandbox_.host("/private/var").c_str(), fsType.c_str(), 0, nullptr), 0);
         mounts_.push_back(sandbox_.host("/private/var"));
@@ -149,6 +164,8 @@ class DataPartitionTest : public ::testing::Test {
     EXPECT_EQ(::mount("/sys", sandbox_.host("/sys").c_str(), nullptr, MS_BIND, nullptr), 0);
     mounts_.insert(mounts_.begin(), sandbox_.host("/sys"));
     EXPECT_EQ(::mount(nullptr, sandbox_.host("/sys").c_str(), nullptr, MS_BIND | MS_REMOUNT | MS_RDONLY, nullptr), 0);
+    mbr_ = firstBlocks(1);
+    dumpHeader_ = DumpHeader(loop_->path());
     return !::testing::Test::HasFailure() && sandbox_.start();
   }
 
@@ -215,6 +232,9 @@ class DataPartitionTest : public ::testing::Test {
       EXPECT_EQ(after.at(name).start, entry.start) << name;
       EXPECT_EQ(after.at(name).size, entry.size) << name;
     }
+    // The MBR with its signature, the disk's GUID and usable range stay.
+    EXPECT_EQ(firstBlocks(1), mbr_);
+    EXPECT_EQ(DumpHeader(loop_->path()), dumpHeader_);
     std::string verdict;
     RunCommand("sgdisk -v " + loop_->path(), &verdict);
     EXPECT_NE(verdict.find("No problems found"), std::string::npos) << verdict;
@@ -255,6 +275,8 @@ class DataPartitionTest : public ::testing::Test {
   std::vector<std::string> mounts_;
   int dataNumber_ = 0;
   std::string skipped_;
+  std::string mbr_;         // the first block as made
+  std::string dumpHeader_;  // sfdisk's header lines as made
 };
 
 #define MAKE_DISK_OR_SKIP(...)                                            \
@@ -291,20 +313,39 @@ TEST_F(DataPartitionTest, BtrfsShrinksThenGrowsWithItsDataIntact) {
   EXPECT_EQ(firstBlocks(3), table);
 }
 
-TEST_F(DataPartitionTest, Ext4GrowsOnlineAndRefusesToShrinkBeforeTheTableIsTouched) {
-  MAKE_DISK_OR_SKIP(kDeviceLayout, true, "ext4");
-  const std::map<std::string, Entry> before = Dump(loop_->path());
-  ASSERT_EQ(command("shrinkDataPartition:"), false);
-  EXPECT_TRUE(dayLogHas("an ext4 file system cannot shrink while it is mounted")) << sandbox_.log();
-  EXPECT_TRUE(dayLogHas("can't shrink partition 1, currently mounted on /private/var"));
-  EXPECT_EQ(Dump(loop_->path()).at("Data").size, before.at("Data").size);
-  EXPECT_FALSE(dayLogHas("Wrote GPT header back to disk"));
+// ext4 and xfs: a shrink is refused in words before the table is touched;
+// a growth works online.
+#define EXPECT_GROWS_ONLY(fsType, refusal)                                                                   \
+  do {                                                                                                       \
+    MAKE_DISK_OR_SKIP(kDeviceLayout, true, fsType);                                                          \
+    const std::map<std::string, Entry> before = Dump(loop_->path());                                         \
+    ASSERT_EQ(command("shrinkDataPartition:"), false);                                                       \
+    EXPECT_TRUE(dayLogHas(refusal)) << sandbox_.log();                                                       \
+    EXPECT_TRUE(dayLogHas("can't shrink partition 1, currently mounted on /private/var"));                   \
+    EXPECT_EQ(Dump(loop_->path()).at("Data").size, before.at("Data").size);                                  \
+    EXPECT_FALSE(dayLogHas("Wrote GPT header back to disk"));                                                \
+    ASSERT_EQ(command("expandDataPartition:"), true) << sandbox_.log();                                      \
+    expectResizedTo(loggedNumber("Block numbers that could be used as data partition = "), before);          \
+  } while (false)
 
+TEST_F(DataPartitionTest, Ext4GrowsOnlineAndRefusesToShrinkBeforeTheTableIsTouched) {
   // Growing ext4 online takes CAP_SYS_RESOURCE, which some machines (and
   // containers) withhold even from root.
   if (!HasCapability(CAP_SYS_RESOURCE)) GTEST_SKIP() << "no CAP_SYS_RESOURCE here: ext4 cannot grow online";
-  ASSERT_EQ(command("expandDataPartition:"), true) << sandbox_.log();
-  expectResizedTo(loggedNumber("Block numbers that could be used as data partition = "), before);
+  EXPECT_GROWS_ONLY("ext4", "an ext4 file system cannot shrink while it is mounted");
+}
+
+TEST_F(DataPartitionTest, XfsGrowsOnlineAndRefusesToShrinkBeforeTheTableIsTouched) {
+  if (RunCommand("command -v mkfs.xfs") != 0) GTEST_SKIP() << "missing mkfs.xfs";
+  EXPECT_GROWS_ONLY("xfs", "an xfs file system cannot shrink");
+}
+
+TEST_F(DataPartitionTest, Ext4RefusesToShrinkEvenWithoutTheRightToGrow) {
+  MAKE_DISK_OR_SKIP(kDeviceLayout, true, "ext4");
+  ASSERT_EQ(command("shrinkDataPartition:"), false);
+  EXPECT_TRUE(dayLogHas("an ext4 file system cannot shrink while it is mounted")) << sandbox_.log();
+  EXPECT_TRUE(validity().valid());
+  EXPECT_EQ(Dump(loop_->path()).at("Data").size, kDeviceLayout[1].size);
 }
 
 TEST_F(DataPartitionTest, AFailedTableWriteAfterTheShrinkLeavesAConsistentDisk) {
