@@ -74,4 +74,12 @@ Result<std::string> PartitionUuidOf(const std::string& devicePath) {
   return std::string(value);
 }
 
+std::vector<PartitionMount> PartitionMounts(const std::vector<MountEntry>& mounts) {
+  std::vector<PartitionMount> found;
+  for (const MountEntry& mount : mounts) {
+    if (mount.source.rfind("/dev/", 0) == 0) found.push_back(PartitionMount{mount, PartitionUuidOf(mount.source)});
+  }
+  return found;
+}
+
 }  // namespace vtr

@@ -24,8 +24,17 @@ Result<std::vector<MountEntry>> ReadMountTable(int procFd);
 
 // The unique GUID (libblkid's PART_ENTRY_UUID, lowercase text) of the GPT
 // entry that describes the partition device at devicePath. libblkid finds
-// the whole disk through /sys and reads its table itself.
+// the whole disk through /sys and reads its table itself. ENOENT when the
+// device has no such entry; another error when it cannot be probed.
 Result<std::string> PartitionUuidOf(const std::string& devicePath);
+
+// The mounts of mounts that come from a device (a source under /dev/),
+// each with its partition's GUID as PartitionUuidOf reads it, in order.
+struct PartitionMount {
+  MountEntry mount;
+  Result<std::string> uuid;
+};
+std::vector<PartitionMount> PartitionMounts(const std::vector<MountEntry>& mounts);
 
 }  // namespace vtr
 

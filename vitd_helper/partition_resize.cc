@@ -18,11 +18,9 @@
 #include "platform/device_properties.h"
 #include "storage/file_system_resize.h"
 #include "storage/gpt_disk.h"
-#include "storage/little_endian.h"
 #include "storage/mount_table.h"
 #include "storage/zarn_adjust.h"
 #include "storage/zarn_geometry.h"
-#include "storage/zarn_layout.h"
 
 namespace vtr {
 namespace {
@@ -132,10 +130,8 @@ std::optional<MountedData> FindMountedFileSystem(const std::string& uuidText) {
   VTRLog("scanning %d filesystems for %s", table.ok() ? static_cast<int>(mounts.size()) : -1, uuidText);
   uuid_t wanted;
   uuid_parse(uuidText.c_str(), wanted);
-  for (const MountEntry& mount : mounts) {
-    if (mount.source.rfind("/dev/", 0) != 0) continue;  // no partition beneath it
+  for (const auto& [mount, uuid] : PartitionMounts(mounts)) {
     const std::string bsdName = mount.source.substr(mount.source.rfind('/') + 1);
-    Result<std::string> uuid = PartitionUuidOf(mount.source);
     if (!uuid.ok()) {
       if (uuid.error().code() == ENOENT) {
         VTRLog("device matching %s has no UUID (unexpected)", bsdName);

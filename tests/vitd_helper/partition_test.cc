@@ -306,6 +306,17 @@ TEST_F(DataPartitionTest, BtrfsShrinksThenGrowsWithItsDataIntact) {
   expectResizedTo(blocks, before);
   EXPECT_EQ(ReadFile(sandbox_.host("/private/var/content")), content);
 
+  // zarnutil shows the disk as the helper saw it, the mounted file system too.
+  HelperSandbox::RunResult shown =
+      sandbox_.run(std::string(VTR_BINARY_DIR) + "/bin/zarnutil", {"disk", loop_->path(), "--json"});
+  EXPECT_EQ(shown.status, 0);
+  for (const std::string& part : {std::string("\"gptValid\":true"), std::string("\"zarnSignature\":true"),
+                                  "\"mountPoint\":\"" + sandbox_.host("/private/var") + "\"",
+                                  "\"type\":\"btrfs\",\"bytes\":" + std::to_string(fileSystemBytes()),
+                                  "\"name\":\"Data\",\"first\":33024,\"last\":" + std::to_string(33024 + blocks - 1)}) {
+    EXPECT_NE(shown.output.find(part), std::string::npos) << part << "\n" << shown.output;
+  }
+
   // Once more: nothing to do, nothing written.
   const std::string table = firstBlocks(3);
   ASSERT_EQ(command("expandDataPartition:"), true);

@@ -27,9 +27,7 @@ std::optional<DataMount> MountOf(const std::string& uuid) {
   UniqueFd proc(::open("/proc", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   Result<std::vector<MountEntry>> mounts = proc ? ReadMountTable(proc.get()) : Error(ENOENT, "/proc");
   if (!mounts.ok()) return std::nullopt;
-  for (const MountEntry& mount : *mounts) {
-    if (mount.source.rfind("/dev/", 0) != 0) continue;
-    Result<std::string> found = PartitionUuidOf(mount.source);
+  for (const auto& [mount, found] : PartitionMounts(*mounts)) {
     if (!found.ok() || *found != uuid) continue;
     Result<MountedFileSystem> fs = DescribeMountedFileSystem(mount.mountPoint, mount.source);
     return DataMount{mount, fs.ok() ? *fs : MountedFileSystem{"unknown", 0}};
