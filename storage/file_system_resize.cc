@@ -9,7 +9,6 @@
 #include <xfs/xfs.h>
 
 #include <cstdio>
-#include <cstring>
 
 #include "platform/unique_fd.h"
 

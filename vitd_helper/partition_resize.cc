@@ -6,7 +6,6 @@
 #include <unistd.h>
 #include <uuid/uuid.h>
 
-#include <array>
 #include <chrono>
 #include <cstring>
 #include <optional>
@@ -30,9 +29,9 @@ DataPartitionDisk& Disk() {
   return disk;
 }
 
-// The partitions the resize knows by name; only "Data" is resized.
-constexpr std::array<const char*, 3> kPartitionNames = {"System", "Data", "Update"};
-constexpr size_t kDataRow = 1;
+// The partition the resize works on (the disk also names "System" and
+// "Update", which it never looks up).
+constexpr char kDataName[] = "Data";
 
 // How long the table write waits for a writer holding the disk's lock.
 constexpr auto kLockPatience = std::chrono::seconds(2);
@@ -41,8 +40,8 @@ struct GptRead {
   GptImage image;
   ZarnMediaProperties props;
   uint64_t blockCount = 0;
-  // The table position of each name of kPartitionNames, -1 when absent.
-  std::array<int, kPartitionNames.size()> positions{-1, -1, -1};
+  // The table position of "Data", -1 when no entry bears the name.
+  int dataPosition = -1;
 
   uint32_t entryCount() const { return image.entryCount(); }
   // Entries the table can hold of those the header counts.
@@ -108,17 +107,12 @@ bool ReadGpt(GptRead* gpt) {
     return false;
   }
   gpt->image = *image;
-  for (size_t row = 0; row < kPartitionNames.size(); ++row) gpt->positions[row] = gpt->image.positionOf(kPartitionNames[row]);
+  gpt->dataPosition = gpt->image.positionOf(kDataName);
   return true;
 }
 
-struct MountedData {
-  std::string mountPoint;
-  std::string source;
-};
-
-// The mounted file system whose partition entry carries uuidText.
-std::optional<MountedData> FindMountedFileSystem(const std::string& uuidText) {
+// The mount point of the file system whose partition entry carries uuidText.
+std::optional<std::string> FindMountedFileSystem(const std::string& uuidText) {
   std::vector<MountEntry> mounts;
   Result<std::vector<MountEntry>> table =
       Disk().procDirectory ? ReadMountTable(Disk().procDirectory->get()) : Error(ENOENT, "no proc directory");
@@ -149,7 +143,7 @@ std::optional<MountedData> FindMountedFileSystem(const std::string& uuidText) {
     VTRLog("UUID %s %smatch", *uuid, match ? "" : "does not ");
     if (match) {
       VTRLog("matched %s on %s", mount.source, mount.mountPoint);
-      return MountedData{mount.mountPoint, mount.source};
+      return mount.mountPoint;
     }
   }
   return std::nullopt;
@@ -241,7 +235,7 @@ int adjust_partition(uint64_t requiredSize) {
   GptRead gpt;
   if (!ReadGpt(&gpt)) return 1;
   const uint32_t count = gpt.entryCount();
-  const uint32_t which = gpt.positions[kDataRow] >= 0 ? static_cast<uint32_t>(gpt.positions[kDataRow]) : count;
+  const uint32_t which = gpt.dataPosition >= 0 ? static_cast<uint32_t>(gpt.dataPosition) : count;
   const uint32_t blockSize = gpt.props.blockSize;
   const uint64_t blocks = requiredSize / blockSize + (requiredSize % blockSize != 0 ? 1 : 0);
   VTRLog("partition: requiredSize=%llu", blocks);
@@ -266,9 +260,9 @@ int adjust_partition(uint64_t requiredSize) {
     return 1;
   }
 
-  std::optional<MountedData> mounted;
-  if (which < count) mounted = FindMountedFileSystem(gpt.image.uuidOf(which));
-  if (!mounted && which < count) {
+  std::optional<std::string> mountPoint;
+  if (which < count) mountPoint = FindMountedFileSystem(gpt.image.uuidOf(which));
+  if (!mountPoint && which < count) {
     VTRLog("filesystem must be mounted (mountPoint=%s,which=%d,nPartitions=%d,newSize=%llu)",
            static_cast<const char*>(nullptr), static_cast<int>(which), static_cast<int>(count), blocks);
     VTRLog("failed to %s partition %d", verb, static_cast<int>(which));
@@ -292,10 +286,10 @@ int adjust_partition(uint64_t requiredSize) {
     return 1;
   }
 
-  if (mounted && newBytes < currentBytes) {
-    VTRLog("shrinking HFS filesystem on %s from %llu to %llu", mounted->mountPoint, currentBytes, newBytes);
-    if (HfsResize(mounted->mountPoint, newBytes) != 0) {
-      VTRLog("can't shrink partition %d, currently mounted on %s", static_cast<int>(which), mounted->mountPoint);
+  if (mountPoint && newBytes < currentBytes) {
+    VTRLog("shrinking HFS filesystem on %s from %llu to %llu", *mountPoint, currentBytes, newBytes);
+    if (HfsResize(*mountPoint, newBytes) != 0) {
+      VTRLog("can't shrink partition %d, currently mounted on %s", static_cast<int>(which), *mountPoint);
       VTRLog("failed to %s partition %d", verb, static_cast<int>(which));
       return 1;
     }
@@ -331,10 +325,10 @@ int adjust_partition(uint64_t requiredSize) {
     return 1;
   }
 
-  if (mounted && currentBytes <= newBytes) {
-    VTRLog("expanding HFS filesystem on %s to %llu", mounted->mountPoint, newBytes);
-    if (HfsResize(mounted->mountPoint, newBytes) != 0) {
-      VTRLog("can't expanding HFS filesystem on %s", mounted->mountPoint);
+  if (mountPoint && currentBytes <= newBytes) {
+    VTRLog("expanding HFS filesystem on %s to %llu", *mountPoint, newBytes);
+    if (HfsResize(*mountPoint, newBytes) != 0) {
+      VTRLog("can't expanding HFS filesystem on %s", *mountPoint);
       return 1;
     }
   }
