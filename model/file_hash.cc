@@ -80,7 +80,7 @@ UniqueFd OpenFileForHashAt(int dirFd, const std::string& name) {
 std::optional<Bytes> fileHashOfDescriptor(int fd, const std::string& path) {
   struct stat st;
   if (fd < 0 || ::fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) {
-    VTRLog("Cannot read file %@", path);
+    VTRLogError("Cannot read file %@", path);
     return std::nullopt;
   }
   HashScratch& scratch = Scratch();
@@ -88,7 +88,7 @@ std::optional<Bytes> fileHashOfDescriptor(int fd, const std::string& path) {
   unsigned int length = 0;
   if (!DigestFile(fd, st.st_size, scratch.context.get(), scratch.chunk.get()) ||
       EVP_DigestFinal_ex(scratch.context.get(), digest.data(), &length) != 1 || length != digest.size()) {
-    VTRLog("Cannot read data from %@.", path);
+    VTRLogError("Cannot read data from %@.", path);
     return std::nullopt;
   }
   return digest;

@@ -96,7 +96,7 @@ ssize_t GetXattr(const XattrSource& item, const std::string& key, void* value, s
 std::optional<std::vector<std::string>> ExtendedAttributeKeys(const XattrSource& item) {
   const ssize_t size = ListXattrs(item, nullptr, 0);
   if (size < 0) {
-    VTRLog("Could not extract extended attributes from %@.", item.path);
+    VTRLogError("Could not extract extended attributes from %@.", item.path);
     return std::nullopt;
   }
   std::vector<std::string> names;
@@ -105,7 +105,7 @@ std::optional<std::vector<std::string>> ExtendedAttributeKeys(const XattrSource&
   std::vector<char> list(static_cast<size_t>(size));
   const ssize_t listed = ListXattrs(item, list.data(), list.size());
   if (listed < 1) {
-    VTRLog("Could not extract extended attributes from %@. File is expected to have extended attributes.",
+    VTRLogError("Could not extract extended attributes from %@. File is expected to have extended attributes.",
            item.path);
     return std::nullopt;
   }
@@ -120,7 +120,7 @@ std::optional<std::vector<std::string>> ExtendedAttributeKeys(const XattrSource&
 Value ExtendedAttributeValue(const std::string& key, const XattrSource& item) {
   const ssize_t size = GetXattr(item, key, nullptr, 0);
   if (size < 0) {
-    VTRLog("Could not extract extended file attributes from %@, returned %d", item.path, static_cast<int>(size));
+    VTRLogError("Could not extract extended file attributes from %@, returned %d", item.path, static_cast<int>(size));
     return Value();
   }
   Bytes value(static_cast<size_t>(size));
@@ -128,7 +128,7 @@ Value ExtendedAttributeValue(const std::string& key, const XattrSource& item) {
   if (read >= 0) {
     value.resize(static_cast<size_t>(read));
   } else {
-    VTRLog("Coud not extract extended file attributes from %@. File is expected to have extended attributes.",
+    VTRLogError("Coud not extract extended file attributes from %@. File is expected to have extended attributes.",
            item.path);
   }
   return Value::Data(std::move(value));
@@ -137,7 +137,7 @@ Value ExtendedAttributeValue(const std::string& key, const XattrSource& item) {
 Value ExtendedAttributes(const XattrSource& item) {
   std::optional<std::vector<std::string>> names = ExtendedAttributeKeys(item);
   if (!names) {
-    VTRLog("Could not get attribute keys from file %@", item.path);
+    VTRLogError("Could not get attribute keys from file %@", item.path);
     return Value();
   }
   DictionaryBuilder attributes;
@@ -153,7 +153,7 @@ Value ExtendedAttributes(const XattrSource& item) {
 
 Value FileAttributes(const Result<Value>& attributes, const std::string& path) {
   if (!attributes.ok()) {
-    VTRLog("Get file attributes failed for %@ with error - %@", path, attributes.error());
+    VTRLogError("Get file attributes failed for %@ with error - %@", path, attributes.error());
     return Value();
   }
   return *attributes;
@@ -161,7 +161,7 @@ Value FileAttributes(const Result<Value>& attributes, const std::string& path) {
 
 Value TargetFile(const Result<std::string>& target, const std::string& path) {
   if (!target.ok()) {
-    VTRLog("Could not get destination of symbolic link %@ with error - %@", path, target.error());
+    VTRLogError("Could not get destination of symbolic link %@ with error - %@", path, target.error());
     return Value();
   }
   return Value::String(*target);
@@ -172,7 +172,7 @@ Value TargetFile(const Result<std::string>& target, const std::string& path) {
 // Nimbrel file (%@)?" for content that cannot be read.
 Value HashOfItem(ItemKind kind, const OpenedItem& item, const std::string& path) {
   if (item.openError == ENOENT) {
-    VTRLog("File does not exist at %@", path);
+    VTRLogError("File does not exist at %@", path);
     return Value();
   }
   if (kind == ItemKind::kDirectory) return Value::Data(Bytes());
@@ -190,7 +190,7 @@ Value VTRFileMetadata::fileHashWithPath(const std::string& path) {
   Result<ParentAndName> item = OpenItemDirectory(path);
   struct stat st;
   if (!item.ok() || ::fstatat(item->parent.get(), item->name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) {
-    VTRLog("File does not exist at %@", path);
+    VTRLogError("File does not exist at %@", path);
     return Value();
   }
   const ItemKind kind = KindOfMode(st.st_mode);
@@ -206,7 +206,7 @@ Value VTRFileMetadata::fileAttributesWithPath(const std::string& path) {
 std::optional<std::vector<std::string>> VTRFileMetadata::extendedAttributeKeysWithPath(const std::string& path) {
   Result<ParentAndName> item = OpenItemDirectory(path);
   if (!item.ok()) {
-    VTRLog("Could not extract extended attributes from %@.", path);
+    VTRLogError("Could not extract extended attributes from %@.", path);
     return std::nullopt;
   }
   return ExtendedAttributeKeys(XattrSource{-1, item->parent.get(), item->name, path, true});
@@ -215,7 +215,7 @@ std::optional<std::vector<std::string>> VTRFileMetadata::extendedAttributeKeysWi
 Value VTRFileMetadata::valueForExtendedAttributesKey(const std::string& key, const std::string& path) {
   Result<ParentAndName> item = OpenItemDirectory(path);
   if (!item.ok()) {
-    VTRLog("Could not extract extended file attributes from %@, returned %d", path, -1);
+    VTRLogError("Could not extract extended file attributes from %@, returned %d", path, -1);
     return Value();
   }
   return ExtendedAttributeValue(key, XattrSource{-1, item->parent.get(), item->name, path, true});
@@ -224,8 +224,8 @@ Value VTRFileMetadata::valueForExtendedAttributesKey(const std::string& key, con
 Value VTRFileMetadata::extendedAttributesWithPath(const std::string& path) {
   Result<ParentAndName> item = OpenItemDirectory(path);
   if (!item.ok()) {
-    VTRLog("Could not extract extended attributes from %@.", path);
-    VTRLog("Could not get attribute keys from file %@", path);
+    VTRLogError("Could not extract extended attributes from %@.", path);
+    VTRLogError("Could not get attribute keys from file %@", path);
     return Value();
   }
   return ExtendedAttributes(XattrSource{-1, item->parent.get(), item->name, path, true});
@@ -241,7 +241,7 @@ std::optional<VTRFileMetadata> VTRFileMetadata::initWithPath(const std::string& 
   Result<ParentAndName> item = OpenItemDirectory(path);
   if (!item.ok()) {
     FileAttributes(item.error(), path);
-    VTRLog("Cannot get file attribute for %@", path);
+    VTRLogError("Cannot get file attribute for %@", path);
     return std::nullopt;
   }
   return initWithItemAt(item->parent.get(), item->name, path);
@@ -251,7 +251,7 @@ std::optional<VTRFileMetadata> VTRFileMetadata::initWithItemAt(int dirFd, const 
                                                                const std::string& path) {
   Value attributes = FileAttributes(AttributesOfItemAt(dirFd, name, path), path);
   if (attributes.isNil()) {
-    VTRLog("Cannot get file attribute for %@", path);
+    VTRLogError("Cannot get file attribute for %@", path);
     return std::nullopt;
   }
   const ItemKind kind = KindOfType(attributes.get(kNSFileType));

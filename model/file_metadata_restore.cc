@@ -50,16 +50,16 @@ bool SetExtendedAttributesWith(const Dictionary* attributes, const std::string& 
   if (attributes == nullptr) return true;
   for (const auto& [name, value] : *attributes) {
     if (name.empty() || name.find('\0') != std::string::npos) {
-      VTRLog("Got Non-string key");
+      VTRLogError("Got Non-string key");
       return false;
     }
     const Bytes* data = value.data();
     if (data == nullptr) {
-      VTRLog("Got non-data value");
+      VTRLogError("Got non-data value");
       return false;
     }
     if (set(name, *data) != 0) {
-      VTRLog("Could not set extended attributes on %@", path);
+      VTRLogError("Could not set extended attributes on %@", path);
       return false;
     }
   }
@@ -113,7 +113,7 @@ bool VTRFileMetadata::restoreAttribuesToPath(const std::string& path) const {
     const Dictionary allowed = attributes != nullptr ? fileAttributesAllowSet(*attributes) : Dictionary();
     Status set = SetAttributes(allowed, path, LinkAtPath::kRefuse);
     if (!set.ok()) {
-      VTRLog("Could not set file attributs at %@ with error - %@, attributes = %@", path, set.error(),
+      VTRLogError("Could not set file attributs at %@ with error - %@, attributes = %@", path, set.error(),
              Value::DictionaryOf(allowed));
       return false;
     }
@@ -122,7 +122,7 @@ bool VTRFileMetadata::restoreAttribuesToPath(const std::string& path) const {
     if (protection != nullptr) protectionOnly = Dictionary({{kNSFileProtectionKey, *protection}});
     set = SetAttributes(protectionOnly, path, LinkAtPath::kRefuse);
     if (!set.ok()) {
-      VTRLog("Could not set file protection key at %@ with error - %@, attributes = %@", path, set.error(),
+      VTRLogError("Could not set file protection key at %@ with error - %@, attributes = %@", path, set.error(),
              protection != nullptr ? *protection : Value());
       return false;
     }
@@ -160,7 +160,7 @@ bool VTRFileMetadata::restoreAttribuesToItemAt(int dirFd, const std::string& nam
     set = item ? SetAttributesOfDescriptor(all, item.get(), path, kAllowedToSet) : Status(Error::FromErrno(path));
   }
   if (!set.ok()) {
-    VTRLog("Could not set file attributs at %@ with error - %@, attributes = %@", path, set.error(),
+    VTRLogError("Could not set file attributs at %@ with error - %@, attributes = %@", path, set.error(),
            Value::DictionaryOf(fileAttributesAllowSet(all)));
     return false;
   }

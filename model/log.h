@@ -4,8 +4,9 @@
 //
 // VTRLog formats the message (printf conversions plus %@, checked when the
 // call is compiled; see platform/format.h) and hands it to the shared
-// VTRLogModel. VTRDebugLog takes the same arguments and does nothing: the
-// step-by-step traces passed to it are never formatted nor emitted.
+// VTRLogModel. VTRLogError does the same for a failure, which the system log
+// then carries at error priority (the day file reads the same). VTRDebugLog takes the same arguments and does nothing:
+// the step-by-step traces passed to it are never formatted nor emitted.
 #ifndef VTR_MODEL_LOG_H_
 #define VTR_MODEL_LOG_H_
 
@@ -16,7 +17,12 @@ namespace vtr {
 
 template <typename... Args>
 void VTRLog(FormatString<std::type_identity_t<Args>...> format, const Args&... args) {
-  VTRLogModel::sharedInstance().logWithFormat<Args...>(format, args...);
+  VTRLogModel::sharedInstance().logWithFormat<Args...>(LogPriority::kNotice, format, args...);
+}
+
+template <typename... Args>
+void VTRLogError(FormatString<std::type_identity_t<Args>...> format, const Args&... args) {
+  VTRLogModel::sharedInstance().logWithFormat<Args...>(LogPriority::kError, format, args...);
 }
 
 template <typename... Args>

@@ -21,7 +21,7 @@ namespace {
 constexpr char kProbeName[] = "testWritability.log";
 
 // Where this thread's messages go instead of being written (ScopedLogDiversion).
-thread_local std::vector<std::string>* t_divertedMessages = nullptr;
+thread_local std::vector<LogLine>* t_divertedMessages = nullptr;
 // The peer whose lines this thread logs (ScopedLogPeer).
 thread_local std::optional<uint32_t> t_logPeer;
 
@@ -64,9 +64,9 @@ VTRLogModel& VTRLogModel::sharedInstance() {
 VTRLogModel::VTRLogModel(std::shared_ptr<SystemLog> systemLog, std::shared_ptr<Clock> clock)
     : systemLog_(std::move(systemLog)), clock_(std::move(clock)) {}
 
-void VTRLogModel::logMessage(std::string_view message) {
+void VTRLogModel::logMessage(std::string_view message, LogPriority priority) {
   if (t_divertedMessages != nullptr) {
-    t_divertedMessages->emplace_back(message);
+    t_divertedMessages->push_back({std::string(message), priority});
     return;
   }
   std::string holder;
@@ -76,13 +76,14 @@ void VTRLogModel::logMessage(std::string_view message) {
     if (!admitPeerLine(*t_logPeer, &suppressed)) return;
     if (suppressed > 0) {
       writeLine(Format("%llu lines caused by uid %u were suppressed", static_cast<unsigned long long>(suppressed),
-                       *t_logPeer));
+                       *t_logPeer),
+                LogPriority::kNotice);
     }
   }
-  writeLine(message);
+  writeLine(message, priority);
 }
 
-void VTRLogModel::writeLine(std::string_view message) {
+void VTRLogModel::writeLine(std::string_view message, LogPriority priority) {
   std::shared_ptr<SystemLog> systemLog;
   {
     std::lock_guard<std::mutex> lock(mutex_);
@@ -93,7 +94,7 @@ void VTRLogModel::writeLine(std::string_view message) {
     }
     systemLog = systemLog_;
   }
-  systemLog->write(message);
+  systemLog->write(message, priority);
 }
 
 bool VTRLogModel::admitPeerLine(uint32_t peer, uint64_t* suppressed) {
@@ -115,7 +116,9 @@ bool VTRLogModel::admitPeerLine(uint32_t peer, uint64_t* suppressed) {
   return true;
 }
 
-void VTRLogModel::systemLogOnly(std::string_view message) { systemLog()->write(message); }
+void VTRLogModel::systemLogOnly(std::string_view message, LogPriority priority) {
+  systemLog()->write(message, priority);
+}
 
 UniqueFd VTRLogModel::openLogFolder(const std::string& directory) {
   Result<std::vector<std::string>> components = SplitPathComponents(directory);
@@ -126,16 +129,18 @@ UniqueFd VTRLogModel::openLogFolder(const std::string& directory) {
   struct stat st;
   if (::fstat(folder->get(), &st) != 0) return UniqueFd();
   if (st.st_uid != ::geteuid() || (st.st_mode & 022) != 0) {
-    systemLogOnly(Format("The log folder %s is owned by uid %u with mode %04o, not by this user and closed to others; "
-                         "logging to the system log only",
-                         directory, st.st_uid, st.st_mode & 07777));
+    systemLogOnly(
+        Format("The log folder %s is owned by uid %u with mode %04o, not by this user and closed to others; "
+               "logging to the system log only",
+               directory, st.st_uid, st.st_mode & 07777));
     return UniqueFd();
   }
   return std::move(*folder);
 }
 
 bool VTRLogModel::openDayFile(int folder, const std::string& name, const std::string& path) {
-  UniqueFd fd(::openat(folder, name.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC, 0644));
+  UniqueFd fd(
+      ::openat(folder, name.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC, 0644));
   struct stat st;
   FILE* fp = nullptr;
   if (fd && ::fstat(fd.get(), &st) == 0 && S_ISREG(st.st_mode) && st.st_uid == ::geteuid() && st.st_nlink == 1) {
@@ -143,9 +148,10 @@ bool VTRLogModel::openDayFile(int folder, const std::string& name, const std::st
     if (fp != nullptr) fd.release();
   } else if (fd || errno == ELOOP) {
     // Someone else's file, a link, a fifo: never written through.
-    systemLogOnly(Format("The log file %s is not a regular file of this user with one link; "
-                         "logging to the system log only",
-                         path));
+    systemLogOnly(
+        Format("The log file %s is not a regular file of this user with one link; "
+               "logging to the system log only",
+               path));
   }
   std::lock_guard<std::mutex> lock(mutex_);
   logFP_ = fp;
@@ -182,10 +188,12 @@ bool VTRLogModel::enableLogToFilesUnder(const std::string& directory, const std:
     std::sort(names->begin(), names->end());
     for (const std::string& name : *names) {
       const std::string fullPath = Format("%@/%@", directory, name);
-      systemLogOnly(FormatEscaped("Checking existing log file (full path) %@ against %@", fullPath, cutoff));
+      systemLogOnly(FormatEscaped("Checking existing log file (full path) %@ against %@", fullPath, cutoff),
+                    LogPriority::kNotice);
       const std::optional<Date> created = CreationDateOfItemAt(folder.get(), name);
       if (created && *created < cutoff) {
-        systemLogOnly(FormatEscaped("Removing %@ whose creation date is %@.", fullPath, *created));
+        systemLogOnly(FormatEscaped("Removing %@ whose creation date is %@.", fullPath, *created),
+                      LogPriority::kNotice);
         (void)RemoveItemAt(folder.get(), name, fullPath);
       }
     }
@@ -230,7 +238,7 @@ void VTRLogModel::setClock(std::shared_ptr<Clock> clock) {
   clock_ = std::move(clock);
 }
 
-ScopedLogDiversion::ScopedLogDiversion(std::vector<std::string>* messages)
+ScopedLogDiversion::ScopedLogDiversion(std::vector<LogLine>* messages)
     : previous_(std::exchange(t_divertedMessages, messages)) {}
 
 ScopedLogDiversion::~ScopedLogDiversion() { t_divertedMessages = previous_; }

@@ -60,14 +60,14 @@ class VTRLogModel {
 
   // Formats the message, values escaped, and writes it (see logMessage).
   template <typename... Args>
-  void logWithFormat(FormatString<std::type_identity_t<Args>...> format, const Args&... args) {
-    logMessage(FormatEscaped(format, args...));
+  void logWithFormat(LogPriority priority, FormatString<std::type_identity_t<Args>...> format, const Args&... args) {
+    logMessage(FormatEscaped(format, args...), priority);
   }
 
   // Appends "<date description> <message>\n" to the log file when file
   // logging is on (flushed at once), and sends the message alone to the
-  // system log in every case.
-  void logMessage(std::string_view message);
+  // system log in every case, with its priority.
+  void logMessage(std::string_view message, LogPriority priority = LogPriority::kNotice);
 
   // Opens path for appending (created if missing, never truncated), creating
   // its parent directory if needed. Returns false when the parent cannot be
@@ -105,10 +105,11 @@ class VTRLogModel {
     uint64_t suppressed = 0;
   };
 
-  // The system log alone, as the expiry sweep reports.
-  void systemLogOnly(std::string_view message);
+  // The system log alone, as the expiry sweep reports (a failure unless
+  // told otherwise).
+  void systemLogOnly(std::string_view message, LogPriority priority = LogPriority::kError);
   // Writes one line to the file and the system log.
-  void writeLine(std::string_view message);
+  void writeLine(std::string_view message, LogPriority priority);
   // Whether a line caused by peer may be written now; *suppressed becomes
   // the count of lines held back before it (to be reported first).
   bool admitPeerLine(uint32_t peer, uint64_t* suppressed);
@@ -132,13 +133,13 @@ class VTRLogModel {
 // collects until it ends. Must end on the thread that made it.
 class ScopedLogDiversion {
  public:
-  explicit ScopedLogDiversion(std::vector<std::string>* messages);
+  explicit ScopedLogDiversion(std::vector<LogLine>* messages);
   ~ScopedLogDiversion();
   ScopedLogDiversion(const ScopedLogDiversion&) = delete;
   ScopedLogDiversion& operator=(const ScopedLogDiversion&) = delete;
 
  private:
-  std::vector<std::string>* previous_;
+  std::vector<LogLine>* previous_;
 };
 
 // While alive, lines logged on the thread that made it are caused by peer

@@ -125,35 +125,34 @@ class VTRManifest::Fill {
   std::string previousKey_ = "/";
 };
 
-VTRManifest::Fill::Outcome VTRManifest::Fill::walk(const std::string& treePath,
-                                                   const std::vector<std::string>& skip) {
+VTRManifest::Fill::Outcome VTRManifest::Fill::walk(const std::string& treePath, const std::vector<std::string>& skip) {
   const unsigned threads = manifest_.recordThreads_;
   RecordPipeline pipeline(threads, threads == 0 ? 1 : kRecordWindow);
   TreeWalker walker(
       treePath,
       [&pipeline](const std::string& path, const Error& error) {
-        pipeline.submitMessage(UnwalkableMessage(kFillErrorHandler, path, error));
+        pipeline.submitMessage(UnwalkableMessage(kFillErrorHandler, path, error), LogPriority::kError);
       },
       [&skip](const std::string& path) { return folder(skip, path); }, manifest_.treeLocation_);
 
   bool walking = true;
   for (;;) {
     if (TerminationRequested()) {
-      VTRLog("Scan of %@ stopped: the helper is terminating", treePath);
+      VTRLogError("Scan of %@ stopped: the helper is terminating", treePath);
       return Outcome::kStopAnswerNo;
     }
     while (walking && !pipeline.full()) {
       if (!walker.next()) {
         walking = false;
       } else if (walker.type() == TreeWalker::ItemType::kOther) {
-        pipeline.submitMessage(Format("%@ is special file. Leave it along", walker.path()));
+        pipeline.submitMessage(Format("%@ is special file. Leave it along", walker.path()), LogPriority::kNotice);
       } else {
         pipeline.submitRecord(walker.path(), walker.parentDirectory(), walker.name());
       }
     }
     if (pipeline.empty()) return Outcome::kGoOn;
     RecordPipeline::Item item = pipeline.take();
-    for (const std::string& message : item.log) VTRLogModel::sharedInstance().logMessage(message);
+    for (const LogLine& line : item.log) VTRLogModel::sharedInstance().logMessage(line.text, line.priority);
     if (!item.wantsRecord) continue;
     if (Outcome outcome = deliver(item.path, item.path, item.record); outcome != Outcome::kGoOn) return outcome;
   }
@@ -166,10 +165,11 @@ VTRManifest::Fill::Outcome VTRManifest::Fill::processTreeItself(const std::strin
   if (folder(skip, path)) return Outcome::kGoOn;
   const TreeLocation& location = manifest_.treeLocation_;
   struct stat st;
-  const int statted = location.parent ? ::fstatat(location.parent->get(), location.name.c_str(), &st, AT_SYMLINK_NOFOLLOW)
-                                      : ::lstat(path.c_str(), &st);
+  const int statted = location.parent
+                          ? ::fstatat(location.parent->get(), location.name.c_str(), &st, AT_SYMLINK_NOFOLLOW)
+                          : ::lstat(path.c_str(), &st);
   if (statted != 0) {
-    VTRLog("Could not get resource for key %@", "NSURLIsRegularFileKey");
+    VTRLogError("Could not get resource for key %@", "NSURLIsRegularFileKey");
     return Outcome::kStopAnswerNo;
   }
   if (!S_ISREG(st.st_mode) && !S_ISDIR(st.st_mode) && !S_ISLNK(st.st_mode)) {
@@ -189,18 +189,19 @@ VTRManifest::Fill::Outcome VTRManifest::Fill::deliver(const std::string& path, c
   // entry: long-standing behaviour that manifests in use rely on.
   if (std::optional<std::string> key = RelativeKey(keyPath, *manifest_.rootPath_)) previousKey_ = std::move(*key);
   if (!record) {
-    VTRLog("Couldn't get meta data for %@", path);
+    VTRLogError("Couldn't get meta data for %@", path);
     return Outcome::kStopAnswerYes;
   }
   // Text that no property list can hold would make the whole manifest
   // unwritable; the item is passed over as one that cannot be walked.
   if (!IsValidUtf8(previousKey_) || !HoldsOnlyUtf8(record->dict())) {
     const std::string shown = ToValidUtf8(path);
-    VTRLogModel::sharedInstance().logMessage(UnwalkableMessage(kFillErrorHandler, shown, Error(EILSEQ, shown)));
+    VTRLogModel::sharedInstance().logMessage(UnwalkableMessage(kFillErrorHandler, shown, Error(EILSEQ, shown)),
+                                             LogPriority::kError);
     return Outcome::kGoOn;
   }
   if (!handler_(*record, previousKey_)) {
-    VTRLog("Couldn't run handler against %@", path);
+    VTRLogError("Couldn't run handler against %@", path);
     return Outcome::kStopAnswerNo;
   }
   if (manifest_.progressUpdater_ != nullptr) {
@@ -308,7 +309,8 @@ uint64_t VTRManifest::calculateTotalFileSize(const std::string& treePath, const 
   TreeWalker walker(
       treePath,
       [](const std::string& path, const Error& error) {
-        VTRLogModel::sharedInstance().logMessage(UnwalkableMessage(kTotalSizeErrorHandler, path, error));
+        VTRLogModel::sharedInstance().logMessage(UnwalkableMessage(kTotalSizeErrorHandler, path, error),
+                                                 LogPriority::kError);
       },
       [&skip](const std::string& path) { return folder(skip, path); }, location);
   uint64_t total = 0;
@@ -316,7 +318,7 @@ uint64_t VTRManifest::calculateTotalFileSize(const std::string& treePath, const 
     if (walker.type() != TreeWalker::ItemType::kRegular) continue;
     struct stat st;
     if (::fstatat(walker.parentFd(), walker.name().c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) {
-      VTRLog("Cound not get attribute for item %@", walker.path());
+      VTRLogError("Cound not get attribute for item %@", walker.path());
       return 0;
     }
     if (S_ISREG(st.st_mode)) total += static_cast<uint64_t>(st.st_size);

@@ -53,9 +53,9 @@ void RecordPipeline::submitRecord(std::string path, std::shared_ptr<const Unique
   if (unpublished_.size() >= kPublishBatch) publish();
 }
 
-void RecordPipeline::submitMessage(std::string message) {
+void RecordPipeline::submitMessage(std::string message, LogPriority priority) {
   Slot& slot = slots_.emplace_back();
-  slot.item.log.push_back(std::move(message));
+  slot.item.log.push_back({std::move(message), priority});
   slot.done.store(true, std::memory_order_relaxed);
 }
 

@@ -40,6 +40,7 @@
 #include <vector>
 
 #include "model/file_metadata.h"
+#include "platform/system_log.h"
 #include "platform/unique_fd.h"
 
 namespace vtr {
@@ -60,7 +61,7 @@ class RecordPipeline {
     bool startsDirectory = false;  // the first of a run of items in one directory
     // Messages for the caller to log, in order, before it uses the item: what
     // making the record logged on a worker, or the text of submitMessage.
-    std::vector<std::string> log;
+    std::vector<LogLine> log;
     // The record of path (absent when it could not be made, or not wanted).
     std::optional<VTRFileMetadata> record;
   };
@@ -84,7 +85,7 @@ class RecordPipeline {
   // full path is path (for messages and for the caller).
   void submitRecord(std::string path, std::shared_ptr<const UniqueFd> directory, std::string name);
   // Queues an item without a record whose only content is message.
-  void submitMessage(std::string message);
+  void submitMessage(std::string message, LogPriority priority);
 
   // The oldest item, once its record is made. Only valid when !empty().
   Item take();

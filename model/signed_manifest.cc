@@ -28,8 +28,8 @@ std::unique_ptr<PlistDocument> OpenDocument(std::span<const uint8_t> bytes, cons
   limits.maxInputBytes = std::max<uint64_t>(limits.maxInputBytes, bytes.size());
   Result<std::unique_ptr<PlistDocument>> document = PlistDocument::Open(bytes, limits);
   if (!document.ok()) {
-    VTRLog("%s: Cannot convert to property list - %@(0x%x).", function, document.error().description(),
-           static_cast<unsigned>(document.error().code()));
+    VTRLogError("%s: Cannot convert to property list - %@(0x%x).", function, document.error().description(),
+                static_cast<unsigned>(document.error().code()));
     return nullptr;
   }
   return std::move(*document);
@@ -67,16 +67,16 @@ std::optional<VTRSignedManifest> VTRSignedManifest::Read(std::string bytes, cons
   if (!contents->outer) return std::nullopt;
   const PlistNode outer = contents->outer->top();
   if (!outer.isDictionary()) {
-    VTRLog("%s: format not correct.", kInit);
+    VTRLogError("%s: format not correct.", kInit);
     return std::nullopt;
   }
   contents->outerVersion = Small(outer.get("Version"));
   if (contents->outerVersion.isNil()) {
-    VTRLog("%s: required key (version) not found.", kInit);
+    VTRLogError("%s: required key (version) not found.", kInit);
     return std::nullopt;
   }
   if (contents->outerVersion.intValue() != 2) {
-    VTRLog("%s: signed manifest version %d is not supported yet", kInit, contents->outerVersion.intValue());
+    VTRLogError("%s: signed manifest version %d is not supported yet", kInit, contents->outerVersion.intValue());
     *failure = SignedManifestFailure::kUnsupportedVersion;
     return std::nullopt;
   }
@@ -90,7 +90,7 @@ std::optional<VTRSignedManifest> VTRSignedManifest::Read(std::string bytes, cons
   const std::optional<std::span<const uint8_t>> payloadBytes = contents->payloadNode.data();
   if (!payloadBytes) {
     // The method name is the only argument; the object prints as (null).
-    VTRLog("%s: required key (payload) not found: %@", kInit, nullptr);
+    VTRLogError("%s: required key (payload) not found: %@", kInit, nullptr);
     return std::nullopt;
   }
   contents->payloadBytes = *payloadBytes;
@@ -102,23 +102,23 @@ std::optional<VTRSignedManifest> VTRSignedManifest::Read(std::string bytes, cons
   if (!contents->payload) return std::nullopt;
   const PlistNode payload = contents->payload->top();
   if (!payload.isDictionary()) {
-    VTRLog("%s: payload format not correct.", kInit);
+    VTRLogError("%s: payload format not correct.", kInit);
     return std::nullopt;
   }
   const Value payloadVersion = Small(payload.get("Version"));
   if (payloadVersion.isNil()) {
-    VTRLog("%s: required key (version) not found.", kInit);
+    VTRLogError("%s: required key (version) not found.", kInit);
     return std::nullopt;
   }
   if (payloadVersion.intValue() != 3 && payloadVersion.intValue() != 4) {
-    VTRLog("%s: raw manifest version %@ is not supported.", kInit, payloadVersion);
+    VTRLogError("%s: raw manifest version %@ is not supported.", kInit, payloadVersion);
     *failure = SignedManifestFailure::kUnsupportedVersion;
     return std::nullopt;
   }
   contents->payloadVersion = payloadVersion.intValue();
   for (const char* key : {"Info", "Backup", "App", "AppData"}) {
     if (payload.get(key).isNil()) {
-      VTRLog("%s: required key (Info, App, AppData, or Manifest) not found: %@", kInit, nullptr);
+      VTRLogError("%s: required key (Info, App, AppData, or Manifest) not found: %@", kInit, nullptr);
       return std::nullopt;
     }
   }
@@ -134,7 +134,7 @@ std::optional<std::span<const uint8_t>> VTRSignedManifest::verifyManifestSignatu
   *failure = SignedManifestFailure::kMalformed;
   const Value certificates = Small(outer.get("Certificate"));
   if (certificates.array() == nullptr) {
-    VTRLog("%s: cannot find certificates, or certificate format not correct.", kVerify);
+    VTRLogError("%s: cannot find certificates, or certificate format not correct.", kVerify);
     return std::nullopt;
   }
   PublicKey key = createPublicKeyForStrongSigning(certificates, anchors);
@@ -147,13 +147,13 @@ std::optional<std::span<const uint8_t>> VTRSignedManifest::verifyManifestSignatu
     }
   }
   if (!key) {
-    VTRLog("%s: Certificate not valid.", kVerify);
+    VTRLogError("%s: Certificate not valid.", kVerify);
     *failure = SignedManifestFailure::kNotTrusted;
     return std::nullopt;
   }
   const std::optional<std::span<const uint8_t>> payload = outer.get("Payload").data();
   if (!payload) {
-    VTRLog("%s: Manifest format not correct.", kVerify);
+    VTRLogError("%s: Manifest format not correct.", kVerify);
     return std::nullopt;
   }
   if (!verifySignature(Small(outer.get("Signature")), *payload, key.get())) {
@@ -164,11 +164,10 @@ std::optional<std::span<const uint8_t>> VTRSignedManifest::verifyManifestSignatu
   return payload;
 }
 
-PublicKey VTRSignedManifest::createPublicKeyForStrongSigning(const Value& certificates,
-                                                             const SigningAnchors& anchors) {
+PublicKey VTRSignedManifest::createPublicKeyForStrongSigning(const Value& certificates, const SigningAnchors& anchors) {
   Result<TrustPolicy> policy = TrustPolicy::Create(anchors.production, anchors.rootFd);
   if (!policy.ok()) {
-    VTRLog("%s: Cannot create policy.", kStrong);
+    VTRLogError("%s: Cannot create policy.", kStrong);
     return nullptr;
   }
   VTRLog("Verifing strong signing");
@@ -185,7 +184,7 @@ PublicKey VTRSignedManifest::createPublicKeyForDevelopmentSigningStandard(const 
                                                                           const SigningAnchors& anchors) {
   Result<TrustPolicy> policy = TrustPolicy::Create(anchors.test, anchors.rootFd);
   if (!policy.ok()) {
-    VTRLog("%s: Cannot create policy.", kDevelopmentStandard);
+    VTRLogError("%s: Cannot create policy.", kDevelopmentStandard);
     return nullptr;
   }
   return createPublicKey(certificates, *policy);
@@ -205,19 +204,19 @@ PublicKey VTRSignedManifest::createPublicKey(const Value& certificates, const Tr
     case TrustOutcome::kTrusted:
       return std::move(evaluation.key);
     case TrustOutcome::kCannotLoadCertificate:
-      VTRLog("%s: Cannot load certificate.", kCertificateBlock);
+      VTRLogError("%s: Cannot load certificate.", kCertificateBlock);
       return nullptr;
     case TrustOutcome::kCannotCreate:
-      VTRLog("%s: Cannot create secure trust object: %ld", kCreatePublicKey, kStatusParameter);
+      VTRLogError("%s: Cannot create secure trust object: %ld", kCreatePublicKey, kStatusParameter);
       return nullptr;
     case TrustOutcome::kCannotEvaluate:
-      VTRLog("%s: Cannot evaluate trust: %ld", kCreatePublicKey, kStatusInternal);
+      VTRLogError("%s: Cannot evaluate trust: %ld", kCreatePublicKey, kStatusInternal);
       return nullptr;
     case TrustOutcome::kNotTrusted:
-      VTRLog("%s: certificate trust evaluation failed: %ld", kCreatePublicKey, kResultRecoverableFailure);
+      VTRLogError("%s: certificate trust evaluation failed: %ld", kCreatePublicKey, kResultRecoverableFailure);
       return nullptr;
     case TrustOutcome::kNoPublicKey:
-      VTRLog("%s: Cannot extract public key.", kCreatePublicKey);
+      VTRLogError("%s: Cannot extract public key.", kCreatePublicKey);
       return nullptr;
   }
   return nullptr;
@@ -227,7 +226,9 @@ bool VTRSignedManifest::verifySignature(const Value& signature, std::span<const 
   VTRDebugLog("verifySignature is called");
   const Bytes* bytes = signature.data();
   const bool verified = bytes != nullptr && VerifyRsaSha1Signature(key, *bytes, data);
-  if (!verified) VTRDebugLog("%s: Failed in verifying signature(%ld)", "-[VTRSignedManifest verifySignature:forData:withKey:]", -67808L);
+  if (!verified)
+    VTRDebugLog("%s: Failed in verifying signature(%ld)", "-[VTRSignedManifest verifySignature:forData:withKey:]",
+                -67808L);
   return verified;
 }
 

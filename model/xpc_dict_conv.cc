@@ -38,7 +38,7 @@ Value XPCDictionaryConversion::initWithXPCDictionary(const XpcDictionary& dictio
   for (const auto& [key, object] : dictionary) {
     std::optional<Value> value = IsValidUtf8(key) ? ConvertValue(object) : std::nullopt;
     if (!value) {
-      VTRLog("The value for key %@ has a type that is not supported yet", ToValidUtf8(key));
+      VTRLogError("The value for key %@ has a type that is not supported yet", ToValidUtf8(key));
       continue;
     }
     builder.add(key, std::move(*value));

@@ -13,14 +13,15 @@ namespace {
 class Syslog final : public SystemLog {
  public:
   explicit Syslog(const char* ident) { openlog(ident, LOG_NDELAY | LOG_PID, LOG_DAEMON); }
-  void write(std::string_view message) override {
-    syslog(LOG_NOTICE, "%.*s", static_cast<int>(message.size()), message.data());
+  void write(std::string_view message, LogPriority priority) override {
+    syslog(priority == LogPriority::kError ? LOG_ERR : LOG_NOTICE, "%.*s", static_cast<int>(message.size()),
+           message.data());
   }
 };
 
 class StderrLog final : public SystemLog {
  public:
-  void write(std::string_view message) override {
+  void write(std::string_view message, LogPriority) override {
     std::string line(message);
     line += '\n';
     std::lock_guard<std::mutex> lock(mutex_);
@@ -36,24 +37,35 @@ class StderrLog final : public SystemLog {
 std::shared_ptr<SystemLog> MakeSyslog(const char* ident) { return std::make_shared<Syslog>(ident); }
 std::shared_ptr<SystemLog> MakeStderrLog() { return std::make_shared<StderrLog>(); }
 
-void MemorySystemLog::write(std::string_view message) {
+void MemorySystemLog::write(std::string_view message, LogPriority priority) {
   std::lock_guard<std::mutex> lock(mutex_);
-  messages_.emplace_back(message);
+  lines_.push_back({std::string(message), priority});
 }
 
 std::vector<std::string> MemorySystemLog::messages() const {
   std::lock_guard<std::mutex> lock(mutex_);
-  return messages_;
+  std::vector<std::string> texts;
+  for (const LogLine& line : lines_) texts.push_back(line.text);
+  return texts;
+}
+
+std::vector<std::string> MemorySystemLog::errors() const {
+  std::lock_guard<std::mutex> lock(mutex_);
+  std::vector<std::string> texts;
+  for (const LogLine& line : lines_) {
+    if (line.priority == LogPriority::kError) texts.push_back(line.text);
+  }
+  return texts;
 }
 
 bool MemorySystemLog::contains(std::string_view text) const {
   std::lock_guard<std::mutex> lock(mutex_);
-  return std::find(messages_.begin(), messages_.end(), text) != messages_.end();
+  return std::any_of(lines_.begin(), lines_.end(), [text](const LogLine& line) { return line.text == text; });
 }
 
 void MemorySystemLog::clear() {
   std::lock_guard<std::mutex> lock(mutex_);
-  messages_.clear();
+  lines_.clear();
 }
 
 }  // namespace vtr

@@ -12,14 +12,25 @@
 
 namespace vtr {
 
+// How urgent a message is: a failure (a command that cannot do its work, a
+// refused client or path) or a notice of what happens.
+enum class LogPriority { kNotice, kError };
+
+// One message with its priority, as held until it is written.
+struct LogLine {
+  std::string text;
+  LogPriority priority = LogPriority::kNotice;
+};
+
 class SystemLog {
  public:
   virtual ~SystemLog() = default;
   // Sends one message (no trailing newline needed).
-  virtual void write(std::string_view message) = 0;
+  virtual void write(std::string_view message, LogPriority priority) = 0;
 };
 
-// syslog(3) with the given ident. The connection to the log socket is opened
+// syslog(3) with the given ident, at LOG_ERR for failures and LOG_NOTICE for
+// the rest. The connection to the log socket is opened
 // at once, so that it survives a later chroot.
 std::shared_ptr<SystemLog> MakeSyslog(const char* ident = "vitd_helper");
 // One line per message on standard error.
@@ -28,15 +39,17 @@ std::shared_ptr<SystemLog> MakeStderrLog();
 // Keeps every message in memory, for tests.
 class MemorySystemLog final : public SystemLog {
  public:
-  void write(std::string_view message) override;
+  void write(std::string_view message, LogPriority priority) override;
   std::vector<std::string> messages() const;
+  // The messages written as failures.
+  std::vector<std::string> errors() const;
   // True when some message equals text exactly.
   bool contains(std::string_view text) const;
   void clear();
 
  private:
   mutable std::mutex mutex_;
-  std::vector<std::string> messages_;
+  std::vector<LogLine> lines_;
 };
 
 }  // namespace vtr

@@ -53,6 +53,6 @@ std::vector<std::string> ClientPathResolver::closedTreesWithin(const CheckedPath
   return within;
 }
 
-void LogRefusal(std::string_view path, const Error& why) { VTRLog("Refused path %@: %@", path, why.message()); }
+void LogRefusal(std::string_view path, const Error& why) { VTRLogError("Refused path %@: %@", path, why.message()); }
 
 }  // namespace vtr

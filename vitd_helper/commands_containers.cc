@@ -27,7 +27,7 @@ bool VTRHMessageResponder::prepareLogContainer(const Value& parameter) {
   const std::string path = PathParameter(parameter);
   // A plain prefix test, not a path-component one: "/var/logsX" passes too.
   if (!HasPrefix(path, "/private/var/logs") && !HasPrefix(path, "/var/logs")) {
-    VTRLog("%s: creating logs under %@ is not allowed.", kMethod, parameter);
+    VTRLogError("%s: creating logs under %@ is not allowed.", kMethod, parameter);
     return false;
   }
   return VTRHOperations::sharedInstance().prepareLogContainer(path);

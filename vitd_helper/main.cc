@@ -97,7 +97,7 @@ int main(int argc, char** argv) {
   // is no basis to serve on.
   Result<ClientAreas> areas = ClientAreas::Load(VTRHOperations::sharedInstance().resolver().root());
   if (!areas.ok()) {
-    VTRLog("Refusing to start: %@", areas.error().message());
+    VTRLogError("Refusing to start: %@", areas.error().message());
     std::fprintf(stderr, "vitd_helper: refusing to start: %s\n", areas.error().message().c_str());
     return 1;
   }

@@ -22,17 +22,17 @@ bool VTRHMessageResponder::hasEntitlementVitrelld() {
   std::shared_ptr<MessagePeer> current = connection();
   Result<SecTask> task = current ? current->copyTask() : Result<SecTask>(Error(ESRCH, ""));
   if (!task.ok()) {
-    VTRLog("%s: Cannot create SecTask from audit token", kHasEntitlementMethod);
+    VTRLogError("%s: Cannot create SecTask from audit token", kHasEntitlementMethod);
     return false;
   }
   const Value value = task->copyValueForEntitlement(kVitrelldEntitlement);
   if (value.isNil()) {
-    VTRLog("%s: No data received.", kHasEntitlementMethod);
+    VTRLogError("%s: No data received.", kHasEntitlementMethod);
     return false;
   }
   std::optional<bool> granted = value.boolean();
   if (!granted) {
-    VTRLog("%s: format not correct: %@", kHasEntitlementMethod, value);
+    VTRLogError("%s: format not correct: %@", kHasEntitlementMethod, value);
     return false;
   }
   return *granted;
@@ -40,7 +40,7 @@ bool VTRHMessageResponder::hasEntitlementVitrelld() {
 
 void VTRHMessageResponder::handleXPCMessage(const XpcObject& request) {
   if (!hasEntitlementVitrelld()) {
-    VTRLog("The client does not have proper entitlement");
+    VTRLogError("The client does not have proper entitlement");
     return;
   }
   ScopedLogPeer entitled(std::nullopt);
@@ -50,12 +50,12 @@ void VTRHMessageResponder::handleXPCMessage(const XpcObject& request) {
   for (const auto& [key, parameter] : *commands) {
     // An empty key names no method at all.
     if (key.empty()) {
-      VTRLog("selector is nil for %@", key);
+      VTRLogError("selector is nil for %@", key);
       return;
     }
     const Command* command = FindCommand(key);
     if (command == nullptr) {
-      VTRLog("%@ does not respond to %@.", kResponderClass, key);
+      VTRLogError("%@ does not respond to %@.", kResponderClass, key);
       return;
     }
     if ((this->*command->method)(parameter)) {

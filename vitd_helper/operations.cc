@@ -95,7 +95,7 @@ bool VTRHOperations::migratePreferencesFile() {
     return false;
   }
   if (!to.ok() || !MoveItemAt(from->get(), name, to->get(), name, source, target).ok()) {
-    VTRLog("Couldn't move %@ to %@", source, target);
+    VTRLogError("Couldn't move %@ to %@", source, target);
     return false;
   }
   // The moved file, as it stands now in mobile's folder: whatever mobile may
@@ -103,7 +103,7 @@ bool VTRHOperations::migratePreferencesFile() {
   // kind (one link, no link to follow).
   Result<UniqueFd> moved = OpenEntryNoFollow(to->get(), name, O_PATH, target);
   if (!moved.ok() || !GiveToAccount(moved->get(), paths_.mobileAccount, target).ok()) {
-    VTRLog("Couldn't change ownership for %@", target);
+    VTRLogError("Couldn't change ownership for %@", target);
     return false;
   }
   return true;
@@ -125,12 +125,12 @@ Result<UniqueFd> VTRHOperations::prepareDirectoryAt(const std::string& path, boo
     // no argument for their last conversion; their texts are kept as they are.
     struct stat st;
     if (::fstat(dir->get(), &st) != 0) {
-      VTRLog("%s: Cannot get attribute from %@", path, nullptr);
+      VTRLogError("%s: Cannot get attribute from %@", path, nullptr);
       return Error::FromErrno(path);
     }
     if (::fchmod(dir->get(), (st.st_mode & 07777) | 0077) != 0) {
       const Error error = Error::FromErrno(path);
-      VTRLog("%s: Cannot set attribute for %@ - %@", path, error.description(), nullptr);
+      VTRLogError("%s: Cannot set attribute for %@ - %@", path, error.description(), nullptr);
       return error;
     }
   }
@@ -139,7 +139,7 @@ Result<UniqueFd> VTRHOperations::prepareDirectoryAt(const std::string& path, boo
     const std::string stagingPath = AppendPathComponent(checked->path, staging);
     Status removed = RemoveItemAt(dir->get(), staging, stagingPath);
     if (!removed.ok()) {
-      VTRLog("%s: Could not remove the path %@ with error - %@(0x%x)", kPrepareDirectoryMethod, stagingPath,
+      VTRLogError("%s: Could not remove the path %@ with error - %@(0x%x)", kPrepareDirectoryMethod, stagingPath,
              removed.error().description(), static_cast<unsigned>(removed.error().code()));
       return removed.error();
     }

@@ -62,7 +62,7 @@ bool VTRHOperations::createDeviceManifest(const std::string& path, bool inclusiv
   const bool scanned = manifest.enumerateAndCollectMetaData(scanRoot, relativeTo, skip, inclusive,
                                                             output.ok() ? (*output)->handler() : discard);
   if (!scanned) {
-    VTRLog("Cannot create device manifest - 1");
+    VTRLogError("Cannot create device manifest - 1");
     return false;  // the temporary file goes; an earlier manifest stays
   }
   if (output.ok()) (void)(*output)->commit();

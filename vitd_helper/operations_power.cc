@@ -28,11 +28,11 @@ std::span<const uint8_t> BytesOf(const std::string& text) {
 bool VTRHOperations::writeNVRam(const std::optional<std::string>& name, const std::optional<std::string>& value) {
   Result<NvramStore> store = NvramStore::Open(resolver_.root(), paths_.efiVariables);
   if (!store.ok()) {
-    VTRLog(kNoOptionsNode);
+    VTRLogError(kNoOptionsNode);
     return false;
   }
   if (!name || !value || !store->write(*name, BytesOf(*value)).ok()) {
-    VTRLog(kWriteFailed);
+    VTRLogError(kWriteFailed);
     return false;
   }
   // The firmware commits each write itself; the "sync" checks that what it
@@ -40,7 +40,7 @@ bool VTRHOperations::writeNVRam(const std::optional<std::string>& name, const st
   Result<std::optional<std::vector<uint8_t>>> held = store->read(*name);
   const std::span<const uint8_t> wanted = BytesOf(*value);
   if (!held.ok() || !std::ranges::equal(held->value_or(std::vector<uint8_t>()), wanted)) {
-    VTRLog(kSyncFailed);
+    VTRLogError(kSyncFailed);
     return false;
   }
   return true;
@@ -49,11 +49,11 @@ bool VTRHOperations::writeNVRam(const std::optional<std::string>& name, const st
 bool VTRHOperations::deleteNvram(const std::optional<std::string>& name) {
   Result<NvramStore> store = NvramStore::Open(resolver_.root(), paths_.efiVariables);
   if (!store.ok()) {
-    VTRLog(kNoOptionsNode);
+    VTRLogError(kNoOptionsNode);
     return false;
   }
   if (!name || !store->remove(*name).ok()) {
-    VTRLog(kSyncFailed);
+    VTRLogError(kSyncFailed);
     return false;
   }
   return true;
@@ -61,12 +61,13 @@ bool VTRHOperations::deleteNvram(const std::optional<std::string>& name) {
 
 bool VTRHOperations::reboot() {
   if (rebootScope_ == RebootScope::kOwnPidNamespace && ::getpid() != 1) {
-    VTRLog("Not rebooting: the helper runs in a sandbox root and is not the first process of its own PID namespace");
+    VTRLogError(
+        "Not rebooting: the helper runs in a sandbox root and is not the first process of its own PID namespace");
     return false;
   }
   ::sync();
   ::reboot(RB_AUTOBOOT);
-  VTRLog("Reboot failed: %s", std::strerror(errno));
+  VTRLogError("Reboot failed: %s", std::strerror(errno));
   return false;
 }
 

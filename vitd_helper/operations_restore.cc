@@ -30,7 +30,7 @@ std::optional<PlistNode> ChooseManifest(const VTRSignedManifest& signedManifest,
   if (type == "AppData") {
     const PlistNode container = signedManifest.getAppDataList().get(id);
     if (container.isNil()) {
-      VTRLog("Couldn't load container data for %@/%@", type, id);
+      VTRLogError("Couldn't load container data for %@/%@", type, id);
       return std::nullopt;
     }
     chosen = container.get("Manifest");
@@ -40,7 +40,7 @@ std::optional<PlistNode> ChooseManifest(const VTRSignedManifest& signedManifest,
     chosen = signedManifest.getPlugInDataList().get(id);
   }
   if (chosen.isNil()) {
-    VTRLog("Couldn't load manifest dict for %@/%@", type, id);
+    VTRLogError("Couldn't load manifest dict for %@/%@", type, id);
     return std::nullopt;
   }
   return chosen;
@@ -63,7 +63,7 @@ bool VTRHOperations::restoreAttributesUnder(const std::string& root, const std::
     bytes = ReadFully(file->get(), kMaxSignedManifestBytes);
   }
   if (!bytes.ok()) {
-    VTRLog("Cannot open manifest file.");
+    VTRLogError("Cannot open manifest file.");
     return false;
   }
   SigningAnchors anchors{paths_.productionAnchors, paths_.testAnchors, paths_.efiVariables, resolver_.root()};
@@ -76,7 +76,7 @@ bool VTRHOperations::restoreAttributesUnder(const std::string& root, const std::
   std::optional<PlistNode> chosen = ChooseManifest(*signedManifest, containerType, identifier);
   if (!chosen) return false;
   if (!chosen->isDictionary()) {
-    VTRLog("Couldn't get manifest.");
+    VTRLogError("Couldn't get manifest.");
     return false;
   }
   if (chosen->count() == 0) return true;  // nothing to restore touches nothing

@@ -27,7 +27,7 @@ bool VTRHOperations::createHardLinks(const std::string& source, const std::strin
                                                 Replication::kHardLink, source, stagingPath)
                                 : Status(toParent.error());
   if (!linked.ok()) {
-    VTRLog("Could not link %@ to %@ with error -%@.", source, stagingPath, linked.error().description());
+    VTRLogError("Could not link %@ to %@ with error -%@.", source, stagingPath, linked.error().description());
     return false;
   }
   return true;
@@ -45,18 +45,18 @@ bool VTRHOperations::moveStagingToFinal(const std::string& stagingPath) {
   }
   // Only a real directory is moved: no link, and not through one.
   Result<UniqueFd> parent = resolver_.openParent(*staging);
-  Result<UniqueFd> directory = parent.ok() ? OpenEntryNoFollow(parent->get(), staging->name(), O_RDONLY | O_DIRECTORY,
-                                                               stagingPath)
-                                           : Result<UniqueFd>(parent.error());
+  Result<UniqueFd> directory =
+      parent.ok() ? OpenEntryNoFollow(parent->get(), staging->name(), O_RDONLY | O_DIRECTORY, stagingPath)
+                  : Result<UniqueFd>(parent.error());
   struct stat staged;
   if (!directory.ok() || ::fstat(directory->get(), &staged) != 0) {
-    VTRLog("Staging path %@ looks wrong.", stagingPath);
+    VTRLogError("Staging path %@ looks wrong.", stagingPath);
     return false;
   }
   Result<UniqueFd> finalParent = resolver_.openParent(*final);
   if (!finalParent.ok()) {
-    VTRLog("Could not move %@ to %@ with error - %@", stagingPath, paths_.finalLocation,
-           finalParent.error().description());
+    VTRLogError("Could not move %@ to %@ with error - %@", stagingPath, paths_.finalLocation,
+                finalParent.error().description());
     return false;
   }
   const std::string& finalName = final->name();
@@ -71,13 +71,14 @@ bool VTRHOperations::moveStagingToFinal(const std::string& stagingPath) {
   // be the directory checked above, not something swapped in since. A
   // rename moves an entry, not a descriptor, so it is checked after and put
   // back when it is not.
-  if (moved.ok() && (::fstatat(finalParent->get(), finalName.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0 ||
-                     !S_ISDIR(st.st_mode))) {
+  if (moved.ok() &&
+      (::fstatat(finalParent->get(), finalName.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0 || !S_ISDIR(st.st_mode))) {
     (void)MoveItemAt(finalParent->get(), finalName, parent->get(), staging->name(), final->path, stagingPath);
     moved = Error(EAGAIN, stagingPath + " changed while it was moved");
   }
   if (!moved.ok()) {
-    VTRLog("Could not move %@ to %@ with error - %@", stagingPath, paths_.finalLocation, moved.error().description());
+    VTRLogError("Could not move %@ to %@ with error - %@", stagingPath, paths_.finalLocation,
+                moved.error().description());
     return false;
   }
   return true;

@@ -54,18 +54,18 @@ int OpenRawDevice(int flags) {
   const char* path = Disk().rawDevice.c_str();
   const int fd = ::open(path, flags | O_CLOEXEC);
   if (fd < 0) {
-    VTRLog("failed to open %s", path);
+    VTRLogError("failed to open %s", path);
     return -1;
   }
   struct stat st;
   if (::fstat(fd, &st) != 0) {
-    VTRLog("failed to stat %s", path);
+    VTRLogError("failed to stat %s", path);
     ::close(fd);
     return -1;
   }
   // A block device of the whole disk, or a disk image.
   if (!S_ISBLK(st.st_mode) && !S_ISREG(st.st_mode)) {
-    VTRLog("%s is not a suitable device (try /dev/rdisk*)", path);
+    VTRLogError("%s is not a suitable device (try /dev/rdisk*)", path);
     ::close(fd);
     return -1;
   }
@@ -79,31 +79,31 @@ bool ReadGpt(GptRead* gpt) {
   UniqueFd closer(fd);
   Result<uint32_t> blockSize = BlockSizeOf(fd);
   if (!blockSize.ok()) {
-    VTRLog("ioctl DKIOCGETBLOCKSIZE failed");
+    VTRLogError("ioctl DKIOCGETBLOCKSIZE failed");
     return false;
   }
   Result<uint64_t> blockCount = BlockCountOf(fd);
   if (!blockCount.ok()) {
-    VTRLog("ioctl DKIOCGETBLOCKCOUNT failed");
+    VTRLogError("ioctl DKIOCGETBLOCKCOUNT failed");
     return false;
   }
   if (zarnInitMediaGeometry(&gpt->props, *blockCount * *blockSize, *blockSize) != 0) {
-    VTRLog("Device %s not suitable", path);
+    VTRLogError("Device %s not suitable", path);
     return false;
   }
   gpt->blockCount = *blockCount;
   Result<bool> signature = ReadZarnSignature(fd, *blockSize);
   if (!signature.ok()) {
-    VTRLog("Failed to read MBR from %s", path);
+    VTRLogError("Failed to read MBR from %s", path);
     return false;
   }
   if (!*signature) {
-    VTRLog("%s not managed by Zarn", path);
+    VTRLogError("%s not managed by Zarn", path);
     return false;
   }
   Result<GptImage> image = ReadGptImage(fd, *blockSize);
   if (!image.ok()) {
-    VTRLog("Failed to read GPT header and table from %s", path);
+    VTRLogError("Failed to read GPT header and table from %s", path);
     return false;
   }
   gpt->image = *image;
@@ -119,7 +119,7 @@ std::optional<std::string> FindMountedFileSystem(const std::string& uuidText) {
   if (table.ok()) {
     mounts = std::move(*table);
   } else {
-    VTRLog("failed to get filesystem information");
+    VTRLogError("failed to get filesystem information");
   }
   VTRLog("scanning %d filesystems for %s", table.ok() ? static_cast<int>(mounts.size()) : -1, uuidText);
   uuid_t wanted;
@@ -128,15 +128,15 @@ std::optional<std::string> FindMountedFileSystem(const std::string& uuidText) {
     const std::string bsdName = mount.source.substr(mount.source.rfind('/') + 1);
     if (!uuid.ok()) {
       if (uuid.error().code() == ENOENT) {
-        VTRLog("device matching %s has no UUID (unexpected)", bsdName);
+        VTRLogError("device matching %s has no UUID (unexpected)", bsdName);
       } else {
-        VTRLog("failed to find an IOService owning %s (unexpected)", bsdName);
+        VTRLogError("failed to find an IOService owning %s (unexpected)", bsdName);
       }
       continue;
     }
     uuid_t found;
     if (uuid_parse(uuid->c_str(), found) != 0) {
-      VTRLog("failed to get string from UUID property (unexpected)");
+      VTRLogError("failed to get string from UUID property (unexpected)");
       continue;
     }
     const bool match = uuid_compare(found, wanted) == 0;
@@ -155,9 +155,9 @@ int HfsResize(const std::string& mountPoint, uint64_t newBytes) {
   if (resized.ok()) return 0;
   // A refusal the helper can explain is said in words first.
   if (resized.error().code() == EOPNOTSUPP || resized.error().code() == EPERM) {
-    VTRLog("%s", resized.error().message());
+    VTRLogError("%s", resized.error().message());
   }
-  VTRLog("HFS resize failed. errno=%d", resized.error().code());
+  VTRLogError("HFS resize failed. errno=%d", resized.error().code());
   return 1;
 }
 
@@ -187,9 +187,7 @@ int MovedEntry(const GptImage& before, const GptImage& after, uint32_t which) {
 }
 
 // One number of the "DiskUsage" answer; 0 when it is missing.
-int64_t DiskUsageNumber(const Value& answer, const char* key) {
-  return answer.get(key).integer().value_or(0);
-}
+int64_t DiskUsageNumber(const Value& answer, const char* key) { return answer.get(key).integer().value_or(0); }
 
 }  // namespace
 
@@ -198,7 +196,7 @@ void SetDataPartitionDisk(DataPartitionDisk disk) { Disk() = std::move(disk); }
 int ShrinkDataPartition() {
   std::optional<Value> usage = DiskUsage(Disk().dataVolume);
   if (!usage) {
-    VTRLog("Cannot get disk usage.");
+    VTRLogError("Cannot get disk usage.");
     return -1;
   }
   const int64_t freeSize = DiskUsageNumber(*usage, kDiskUsageTotalDataAvailable);
@@ -246,7 +244,7 @@ int adjust_partition(uint64_t requiredSize) {
   if (sum > gpt.image.lastUsableLba() - gpt.image.firstUsableLba() + 1) return 1;
 
   if (blocks == 0) {
-    VTRLog("deletion of partition %d disallowed", 1);
+    VTRLogError("deletion of partition %d disallowed", 1);
     return 1;
   }
   if (which < count && blocks == gpt.blocksOf(which)) {
@@ -255,17 +253,17 @@ int adjust_partition(uint64_t requiredSize) {
   }
   const char* verb = which == count ? "create" : "adjust";
   if (which > 7 || which > count) {
-    VTRLog("bad partion number");
-    VTRLog("failed to %s partition %d", verb, static_cast<int>(which));
+    VTRLogError("bad partion number");
+    VTRLogError("failed to %s partition %d", verb, static_cast<int>(which));
     return 1;
   }
 
   std::optional<std::string> mountPoint;
   if (which < count) mountPoint = FindMountedFileSystem(gpt.image.uuidOf(which));
   if (!mountPoint && which < count) {
-    VTRLog("filesystem must be mounted (mountPoint=%s,which=%d,nPartitions=%d,newSize=%llu)",
-           static_cast<const char*>(nullptr), static_cast<int>(which), static_cast<int>(count), blocks);
-    VTRLog("failed to %s partition %d", verb, static_cast<int>(which));
+    VTRLogError("filesystem must be mounted (mountPoint=%s,which=%d,nPartitions=%d,newSize=%llu)",
+                static_cast<const char*>(nullptr), static_cast<int>(which), static_cast<int>(count), blocks);
+    VTRLogError("failed to %s partition %d", verb, static_cast<int>(which));
     return 1;
   }
   const uint64_t newBytes = blocks * blockSize;
@@ -276,21 +274,21 @@ int adjust_partition(uint64_t requiredSize) {
   // it is) stops here, with the file system untouched.
   GptImage adjusted = gpt.image;
   if (zarnAdjustPartition(&gpt.props, adjusted.header.data(), adjusted.table.data(), which, newBytes) != 0) {
-    VTRLog("adjustment failed");
-    VTRLog("failed to %s partition %d", verb, static_cast<int>(which));
+    VTRLogError("adjustment failed");
+    VTRLogError("failed to %s partition %d", verb, static_cast<int>(which));
     return 1;
   }
   if (const int moved = MovedEntry(gpt.image, adjusted, which); moved >= 0) {
-    VTRLog("the new layout would move the start of partition %d, whose data would not move with it", moved);
-    VTRLog("failed to %s partition %d", verb, static_cast<int>(which));
+    VTRLogError("the new layout would move the start of partition %d, whose data would not move with it", moved);
+    VTRLogError("failed to %s partition %d", verb, static_cast<int>(which));
     return 1;
   }
 
   if (mountPoint && newBytes < currentBytes) {
     VTRLog("shrinking HFS filesystem on %s from %llu to %llu", *mountPoint, currentBytes, newBytes);
     if (HfsResize(*mountPoint, newBytes) != 0) {
-      VTRLog("can't shrink partition %d, currently mounted on %s", static_cast<int>(which), *mountPoint);
-      VTRLog("failed to %s partition %d", verb, static_cast<int>(which));
+      VTRLogError("can't shrink partition %d, currently mounted on %s", static_cast<int>(which), *mountPoint);
+      VTRLogError("failed to %s partition %d", verb, static_cast<int>(which));
       return 1;
     }
   }
@@ -304,14 +302,14 @@ int adjust_partition(uint64_t requiredSize) {
   const char* path = Disk().rawDevice.c_str();
   const int fd = OpenRawDeviceLocked();
   if (fd < 0) {
-    VTRLog("Failed to open %s to write new GPT header out to disk.\n", path);
+    VTRLogError("Failed to open %s to write new GPT header out to disk.\n", path);
     return 1;
   }
   UniqueFd closer(fd);
   if (Status written = WriteGptWithBackup(fd, blockSize, gpt.blockCount, adjusted); !written.ok()) {
     const int error = written.error().code();
-    VTRLog("failed to write GPT header and table to %s (return %d). errno=%d : %s", path, -1, error,
-           std::strerror(error));
+    VTRLogError("failed to write GPT header and table to %s (return %d). errno=%d : %s", path, -1, error,
+                std::strerror(error));
     return 1;
   }
   VTRLog("Wrote GPT header back to disk");
@@ -321,14 +319,15 @@ int adjust_partition(uint64_t requiredSize) {
   closer.reset();
   ::sync();
   if (!told.ok()) {
-    VTRLog("Could not tell the kernel the new size of partition %d: %@", static_cast<int>(which) + 1, told.error());
+    VTRLogError("Could not tell the kernel the new size of partition %d: %@", static_cast<int>(which) + 1,
+                told.error());
     return 1;
   }
 
   if (mountPoint && currentBytes <= newBytes) {
     VTRLog("expanding HFS filesystem on %s to %llu", *mountPoint, newBytes);
     if (HfsResize(*mountPoint, newBytes) != 0) {
-      VTRLog("can't expanding HFS filesystem on %s", *mountPoint);
+      VTRLogError("can't expanding HFS filesystem on %s", *mountPoint);
       return 1;
     }
   }

@@ -66,7 +66,7 @@ int HelperService::createXPCListener() {
   options.trustPeer = TrustPeer;
   Result<std::unique_ptr<Listener>> listener = Listener::Create(socketPath_, options);
   if (!listener.ok()) {
-    VTRLog("Could not create XPC listener.");
+    VTRLogError("Could not create XPC listener.");
     return 1;
   }
   listener_ = std::move(*listener);
@@ -102,10 +102,10 @@ void HelperService::handleListenerEvent(const ListenerEvent& event) {
       VTRLog("XPC connection will be closed");
       return finish(0);
     case ListenerEvent::Kind::kConnectionInvalid:
-      VTRLog("No XPC connection, exiting");
+      VTRLogError("No XPC connection, exiting");
       return finish(0);
     case ListenerEvent::Kind::kError:
-      VTRLog("Got XPC error on listener connection: %s", event.description);
+      VTRLogError("Got XPC error on listener connection: %s", event.description);
       listener_->cancel();
       return finish(1);
   }

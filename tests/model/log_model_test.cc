@@ -53,10 +53,12 @@ class LogModelTest : public ::testing::Test {
   VTRLogModel model_;
 };
 
-TEST_F(LogModelTest, WithoutFileOnlyTheSystemLogGetsTheBareMessage) {
-  model_.logWithFormat("Couldn't move %@ to %@", std::string("/a"), std::string("/b"));
+TEST_F(LogModelTest, WithoutFileOnlyTheSystemLogGetsTheBareMessageWithItsPriority) {
+  model_.logWithFormat(LogPriority::kError, "Couldn't move %@ to %@", std::string("/a"), std::string("/b"));
+  model_.logWithFormat(LogPriority::kNotice, "Entering %s", "x");
   EXPECT_FALSE(model_.logToFileEnabled());
-  EXPECT_EQ(systemLog_->messages(), std::vector<std::string>{"Couldn't move /a to /b"});
+  EXPECT_EQ(systemLog_->messages(), (std::vector<std::string>{"Couldn't move /a to /b", "Entering x"}));
+  EXPECT_EQ(systemLog_->errors(), std::vector<std::string>{"Couldn't move /a to /b"});
 }
 
 TEST_F(LogModelTest, FileLinesCarryTheUtcDateAndKeepATrailingNewline) {

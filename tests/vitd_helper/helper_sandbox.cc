@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <sched.h>
 #include <signal.h>
+#include <sys/mman.h>
 #include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
@@ -127,9 +128,12 @@ HelperSandbox::RunResult HelperSandbox::run(const std::string& executable,
                                             const std::vector<std::string>& args) const {
   int out[2];
   if (::pipe2(out, O_CLOEXEC) != 0) return {};
+  // Standard error goes to a memory file, read once the client has ended.
+  UniqueFd errors(::memfd_create("client-stderr", MFD_CLOEXEC));
   const pid_t pid = ::fork();
   if (pid == 0) {
     ::dup2(out[1], STDOUT_FILENO);
+    if (errors) ::dup2(errors.get(), STDERR_FILENO);
     std::vector<char*> argv;
     argv.push_back(const_cast<char*>(executable.c_str()));
     for (const std::string& a : args) argv.push_back(const_cast<char*>(a.c_str()));
@@ -146,6 +150,8 @@ HelperSandbox::RunResult HelperSandbox::run(const std::string& executable,
   int raw = 0;
   ::waitpid(pid, &raw, 0);
   result.status = StatusOf(raw);
+  ::lseek(errors.get(), 0, SEEK_SET);
+  while (errors && (n = ::read(errors.get(), buf, sizeof buf)) > 0) result.errors.append(buf, static_cast<size_t>(n));
   return result;
 }
 

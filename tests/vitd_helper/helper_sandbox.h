@@ -53,10 +53,11 @@ class HelperSandbox {
 
   // Runs a client executable with arguments (e.g. a vitdctl variant with
   // "--root <root> --timeout 1 prepareWorkContainer /x"); returns its exit
-  // status and its standard output.
+  // status, its standard output and its standard error.
   struct RunResult {
     int status = -1;
     std::string output;
+    std::string errors;
   };
   RunResult run(const std::string& executable, const std::vector<std::string>& args) const;
 

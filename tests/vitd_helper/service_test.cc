@@ -66,6 +66,10 @@ TEST_F(ServiceTest, OnlyAnEntitledClientIsServed) {
   }
   ASSERT_EQ(::chmod(writable.c_str(), 0777), 0);
   ASSERT_EQ(::chown(foreign.c_str(), kMobileUid, kMobileGid), 0);
+  HelperSandbox::RunResult copy = vitdctl(writable, {"prepareWorkContainer", "/private/var/U"});
+  EXPECT_NE(copy.errors.find("owned by root and not writable by group or others (it is owned by uid 0,\n  mode 777)"),
+            std::string::npos)
+      << copy.errors;
   const Case refused[] = {
       {UnentitledVitdctlExecutable(), "-[VTRHMessageResponder hasEntitlementVitrelld]: No data received."},
       {StringEntitledVitdctlExecutable(), "-[VTRHMessageResponder hasEntitlementVitrelld]: format not correct: true"},
@@ -76,6 +80,8 @@ TEST_F(ServiceTest, OnlyAnEntitledClientIsServed) {
     HelperSandbox::RunResult r = vitdctl(c.executable, {"prepareWorkContainer", "/private/var/U"});
     EXPECT_EQ(r.status, 2) << c.executable;  // no answer at all
     EXPECT_EQ(r.output, "") << c.executable;
+    // vitdctl says what usually causes the silence.
+    EXPECT_NE(r.errors.find("not entitled"), std::string::npos) << r.errors;
     EXPECT_FALSE(IsDirectory(sandbox_.host("/private/var/U"))) << c.executable;
     EXPECT_TRUE(sandbox_.logged(c.reason)) << c.executable << "\n" << sandbox_.log();
   }
@@ -139,6 +145,29 @@ TEST_F(ServiceTest, KeysAreWalkedInOrderAndAnUnknownKeyEndsTheWalk) {
       2, 1000ms);
   EXPECT_EQ(one, std::vector<XpcObject>{Response(true)});
   EXPECT_TRUE(sandbox_.logged("VTRHMessageResponder does not respond to sendPassResponse."));
+}
+
+TEST_F(ServiceTest, TheExampleClientAndVitdctlDriveTheHelperThroughTheClientLibrary) {
+  const std::string example = std::string(VTR_BINARY_DIR) + "/bin/vitd-example";
+  HelperSandbox::RunResult made =
+      sandbox_.run(example, {"-s", sandbox_.socketPath(), "prepareWorkContainer", "\"/private/var/E\""});
+  EXPECT_EQ(made.status, 0) << made.errors;
+  EXPECT_EQ(made.output, "prepareWorkContainer: response true\n");
+  EXPECT_TRUE(IsDirectory(sandbox_.host("/private/var/E")));
+  HelperSandbox::RunResult refused =
+      sandbox_.run(example, {"-s", sandbox_.socketPath(), "writeNvram", R"({"Name": "a/b", "Value": "x"})"});
+  EXPECT_EQ(refused.status, 1);
+  EXPECT_EQ(refused.output, "writeNvram: response false\n");
+
+  // A request whose second key the helper does not know: one answer, then
+  // vitdctl says why the second never comes.
+  TempDir dir;
+  WriteFile(dir / "request.json", R"({"prepareWorkContainer:": "/private/var/F", "zzz:": true})");
+  HelperSandbox::RunResult partial = vitdctl(VitdctlExecutable(), {"send", dir / "request.json"});
+  EXPECT_EQ(partial.status, 2);
+  EXPECT_EQ(partial.output, "{\"Response\":true}\n");
+  EXPECT_NE(partial.errors.find("after 1 of 2 responses"), std::string::npos) << partial.errors;
+  EXPECT_NE(partial.errors.find("a request key it does not know"), std::string::npos) << partial.errors;
 }
 
 TEST_F(ServiceTest, ValuesOfOtherTypesAreLeftOut) {

@@ -15,7 +15,7 @@ namespace {
 
 using namespace vtr::vitdctl;
 
-constexpr char kDefaultSocket[] = "/run/com.orvane.vitrelldhelper.sock";
+constexpr char kDefaultSocket[] = VITD_HELPER_SOCKET;
 
 void PrintUsage(FILE* out) {
   std::fprintf(out,
@@ -96,7 +96,7 @@ int main(int argc, char** argv) {
 
   const std::string command = argv[optind];
   const std::vector<std::string> args(argv + optind + 1, argv + argc);
-  vtr::Result<vtr::XpcObject> request = vtr::Error::Invalid("");
+  UniqueValue request;
   if (command == "listNvram") {
     if (args.size() > 1 || (args.size() == 1 && args[0] != "--json")) UsageError("listNvram takes only --json");
     if (!socket.empty()) UsageError("listNvram reads the variables here: it takes --root, not --socket");
@@ -105,17 +105,20 @@ int main(int argc, char** argv) {
   bool endsHelper = false;
   if (command == "send") {
     if (args.size() != 1) UsageError("send takes one FILE (or - for standard input)");
-    request = ReadRequestFile(args[0]);
-    if (!request.ok()) UsageError("cannot read the request: " + request.error().description());
+    vtr::Result<UniqueValue> read = ReadRequestFile(args[0]);
+    if (!read.ok()) UsageError("cannot read the request: " + read.error().description());
+    request = std::move(read).value();
   } else if (const SubCommand* sub = FindSubCommand(command)) {
-    vtr::Result<vtr::XpcObject> parameter = sub->parameter(args);
+    vtr::Result<UniqueValue> parameter = sub->parameter(args);
     if (!parameter.ok()) UsageError(command + " " + parameter.error().description());
-    request = RequestFor(*sub, std::move(parameter).value());
+    request.reset(vitd_dictionary());
+    vitd_dictionary_set(request.get(), (command + ":").c_str(), std::move(parameter).value().release());
     endsHelper = sub->endsHelper;
   } else {
     UsageError("unknown command '" + command + "'");
   }
   options.progressBar = ::isatty(STDOUT_FILENO) == 1;
   options.closeIsSuccess = endsHelper;
+  if (request == nullptr) UsageError("out of memory");
   return RunSession(options, *request, stdout);
 }

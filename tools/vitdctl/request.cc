@@ -1,62 +1,16 @@
 #include "tools/vitdctl/request.h"
 
-#include <nlohmann/json.hpp>
-
 #include <cmath>
 #include <fstream>
 #include <iostream>
 #include <iterator>
 #include <sstream>
+#include <utility>
 
 #include "platform/plist.h"
 
 namespace vtr::vitdctl {
 namespace {
-
-using Json = nlohmann::json;
-
-// Deepest JSON nesting accepted (the helper takes 64 levels).
-constexpr int kMaxJsonDepth = 64;
-
-Result<XpcObject> FromJson(const Json& json, int depth) {
-  if (depth > kMaxJsonDepth) return Error::Invalid("JSON nested too deeply");
-  switch (json.type()) {
-    case Json::value_t::null:
-      return XpcObject::Null();
-    case Json::value_t::boolean:
-      return XpcObject::Bool(json.get<bool>());
-    case Json::value_t::number_integer:
-      return XpcObject::Int64(json.get<int64_t>());
-    case Json::value_t::number_unsigned: {
-      const uint64_t u = json.get<uint64_t>();
-      return u <= static_cast<uint64_t>(INT64_MAX) ? XpcObject::Int64(static_cast<int64_t>(u)) : XpcObject::Uint64(u);
-    }
-    case Json::value_t::number_float:
-      return XpcObject::Double(json.get<double>());
-    case Json::value_t::string:
-      return XpcObject::String(json.get<std::string>());
-    case Json::value_t::array: {
-      XpcArray items;
-      for (const Json& item : json) {
-        Result<XpcObject> converted = FromJson(item, depth + 1);
-        if (!converted.ok()) return converted;
-        items.push_back(std::move(converted).value());
-      }
-      return XpcObject::Array(std::move(items));
-    }
-    case Json::value_t::object: {
-      XpcDictionary dict;
-      for (const auto& [key, item] : json.items()) {
-        Result<XpcObject> converted = FromJson(item, depth + 1);
-        if (!converted.ok()) return converted;
-        dict.set(key, std::move(converted).value());
-      }
-      return XpcObject::Dictionary(std::move(dict));
-    }
-    default:
-      return Error::Invalid("JSON value of an unsupported kind");
-  }
-}
 
 Result<std::string> ReadAll(const std::string& path) {
   if (path == "-") {
@@ -75,18 +29,27 @@ bool LooksLikeJson(const std::string& path, const std::string& text) {
   return first != std::string::npos && text[first] == '{';
 }
 
+UniqueValue String(const std::string& text) { return UniqueValue(vitd_string(text.c_str())); }
+
+// A dictionary of the entries, which it takes over.
+UniqueValue Dictionary(std::initializer_list<std::pair<const char*, vitd_value*>> entries) {
+  UniqueValue dict(vitd_dictionary());
+  for (const auto& [key, item] : entries) vitd_dictionary_set(dict.get(), key, item);
+  return dict;
+}
+
 // Sub-command parameters.
-Result<XpcObject> NoParameter(const std::vector<std::string>& args) {
+Result<UniqueValue> NoParameter(const std::vector<std::string>& args) {
   if (!args.empty()) return Error::Invalid("takes no arguments");
-  return XpcObject::Bool(true);
+  return UniqueValue(vitd_bool(1));
 }
 
-Result<XpcObject> OnePath(const std::vector<std::string>& args) {
+Result<UniqueValue> OnePath(const std::vector<std::string>& args) {
   if (args.size() != 1) return Error::Invalid("takes exactly one PATH");
-  return XpcObject::String(args[0]);
+  return String(args[0]);
 }
 
-Result<XpcObject> ManifestParameter(const std::vector<std::string>& args) {
+Result<UniqueValue> ManifestParameter(const std::vector<std::string>& args) {
   std::string path;
   bool inclusive = false;
   for (const std::string& arg : args) {
@@ -99,96 +62,98 @@ Result<XpcObject> ManifestParameter(const std::vector<std::string>& args) {
     }
   }
   if (path.empty()) return Error::Invalid("takes a PATH");
-  return XpcObject::Dictionary({{"Path", XpcObject::String(path)}, {"Inclusive", XpcObject::Bool(inclusive)}});
+  return Dictionary({{"Path", vitd_string(path.c_str())}, {"Inclusive", vitd_bool(inclusive)}});
 }
 
-Result<XpcObject> HardLinkParameter(const std::vector<std::string>& args) {
+Result<UniqueValue> HardLinkParameter(const std::vector<std::string>& args) {
   if (args.size() != 2) return Error::Invalid("takes FILE and STAGING_PATH");
-  return XpcObject::Dictionary({{"FilePath", XpcObject::String(args[0])}, {"StagingPath", XpcObject::String(args[1])}});
+  return Dictionary({{"FilePath", vitd_string(args[0].c_str())}, {"StagingPath", vitd_string(args[1].c_str())}});
 }
 
 // STAGING_ROOT MANIFEST [--type TYPE] [--identifier ID]: a missing type or
 // identifier stays out of the request (the whole device).
-Result<XpcObject> RestoreParameter(const std::vector<std::string>& args) {
+Result<UniqueValue> RestoreParameter(const std::vector<std::string>& args) {
   std::vector<std::string> paths;
-  XpcDictionary parameter;
+  UniqueValue parameter(vitd_dictionary());
   for (size_t i = 0; i < args.size(); ++i) {
     const bool named = args[i] == "--type" || args[i] == "--identifier";
     if (named && i + 1 == args.size()) return Error::Invalid(args[i] + " needs a value");
     if (named) {
       const char* key = args[i] == "--type" ? "ContentType" : "Identifier";
-      parameter.set(key, XpcObject::String(args[i + 1]));
+      vitd_dictionary_set(parameter.get(), key, vitd_string(args[i + 1].c_str()));
       ++i;
     } else {
       paths.push_back(args[i]);
     }
   }
   if (paths.size() != 2) return Error::Invalid("takes STAGING_ROOT and MANIFEST");
-  parameter.set("StagingRootPath", XpcObject::String(paths[0]));
-  parameter.set("ManifestPath", XpcObject::String(paths[1]));
-  return XpcObject::Dictionary(std::move(parameter));
+  vitd_dictionary_set(parameter.get(), "StagingRootPath", vitd_string(paths[0].c_str()));
+  vitd_dictionary_set(parameter.get(), "ManifestPath", vitd_string(paths[1].c_str()));
+  return parameter;
 }
 
-Result<XpcObject> NvramWriteParameter(const std::vector<std::string>& args) {
+Result<UniqueValue> NvramWriteParameter(const std::vector<std::string>& args) {
   if (args.size() != 2) return Error::Invalid("takes NAME and VALUE");
-  return XpcObject::Dictionary({{"Name", XpcObject::String(args[0])}, {"Value", XpcObject::String(args[1])}});
+  return Dictionary({{"Name", vitd_string(args[0].c_str())}, {"Value", vitd_string(args[1].c_str())}});
 }
 
-Result<XpcObject> NvramName(const std::vector<std::string>& args) {
+Result<UniqueValue> NvramName(const std::vector<std::string>& args) {
   if (args.size() != 1) return Error::Invalid("takes exactly one NAME");
-  return XpcObject::String(args[0]);
+  return String(args[0]);
 }
 
 }  // namespace
 
-XpcObject XpcObjectFromValue(const Value& value) {
+UniqueValue MessageValueOf(const Value& value) {
   switch (value.type()) {
     case Value::Type::kNil:
-      return XpcObject::Null();
+      return UniqueValue(vitd_null());
     case Value::Type::kBoolean:
-      return XpcObject::Bool(*value.boolean());
+      return UniqueValue(vitd_bool(*value.boolean()));
     case Value::Type::kInteger:
-      return XpcObject::Int64(*value.integer());
+      return UniqueValue(vitd_int64(*value.integer()));
     case Value::Type::kUnsigned:
-      return XpcObject::Uint64(*value.unsignedInteger());
+      return UniqueValue(vitd_uint64(*value.unsignedInteger()));
     case Value::Type::kReal:
-      return XpcObject::Double(*value.real());
+      return UniqueValue(vitd_double(*value.real()));
     case Value::Type::kString:
-      return XpcObject::String(*value.string());
+      return String(*value.string());
     case Value::Type::kData:
-      return XpcObject::Data(*value.data());
+      return UniqueValue(vitd_data(value.data()->data(), value.data()->size()));
     case Value::Type::kDate:
-      return XpcObject::Date(static_cast<int64_t>(std::llround(value.date()->unixSeconds() * 1e9)));
+      return UniqueValue(vitd_date(static_cast<int64_t>(std::llround(value.date()->unixSeconds() * 1e9))));
     case Value::Type::kArray: {
-      XpcArray items;
-      for (const Value& item : *value.array()) items.push_back(XpcObjectFromValue(item));
-      return XpcObject::Array(std::move(items));
+      UniqueValue items(vitd_array());
+      for (const Value& item : *value.array()) vitd_array_append(items.get(), MessageValueOf(item).release());
+      return items;
     }
     case Value::Type::kDictionary: {
-      XpcDictionary dict;
-      for (const auto& [key, item] : *value.dictionary()) dict.set(key, XpcObjectFromValue(item));
-      return XpcObject::Dictionary(std::move(dict));
+      UniqueValue dict(vitd_dictionary());
+      for (const auto& [key, item] : *value.dictionary()) {
+        vitd_dictionary_set(dict.get(), key.c_str(), MessageValueOf(item).release());
+      }
+      return dict;
     }
   }
-  return XpcObject::Null();
+  return UniqueValue(vitd_null());
 }
 
-Result<XpcObject> RequestFromJson(const std::string& text) {
-  Json json = Json::parse(text, nullptr, /*allow_exceptions=*/false);
-  if (json.is_discarded()) return Error::Invalid("not valid JSON");
-  if (!json.is_object()) return Error::Invalid("the request must be a JSON object");
-  return FromJson(json, 1);
-}
-
-Result<XpcObject> ReadRequestFile(const std::string& path) {
+Result<UniqueValue> ReadRequestFile(const std::string& path) {
   Result<std::string> text = ReadAll(path);
   if (!text.ok()) return text.error();
-  if (LooksLikeJson(path, *text)) return RequestFromJson(*text);
+  if (LooksLikeJson(path, *text)) {
+    vitd_value* request = nullptr;
+    const int status = vitd_value_from_json(text->c_str(), &request);
+    if (status != VITD_OK) return Error::Invalid(vitd_strerror(status));
+    UniqueValue owned(request);
+    if (vitd_value_type(request) != VITD_TYPE_DICTIONARY) return Error::Invalid("the request must be a JSON object");
+    return owned;
+  }
   const auto* bytes = reinterpret_cast<const uint8_t*>(text->data());
   Result<Value> plist = ReadPropertyList(std::span<const uint8_t>(bytes, text->size()));
   if (!plist.ok()) return plist.error();
   if (plist->dictionary() == nullptr) return Error::Invalid("the request must be a dictionary");
-  return XpcObjectFromValue(*plist);
+  return MessageValueOf(*plist);
 }
 
 const std::vector<SubCommand>& SubCommands() {
@@ -222,10 +187,6 @@ const SubCommand* FindSubCommand(const std::string& name) {
     if (name == command.name) return &command;
   }
   return nullptr;
-}
-
-XpcObject RequestFor(const SubCommand& command, XpcObject parameter) {
-  return XpcObject::Dictionary({{std::string(command.name) + ":", std::move(parameter)}});
 }
 
 }  // namespace vtr::vitdctl

@@ -3,27 +3,30 @@
 #ifndef VTR_TOOLS_VITDCTL_REQUEST_H_
 #define VTR_TOOLS_VITDCTL_REQUEST_H_
 
+#include <memory>
 #include <string>
 #include <vector>
 
+#include "client/vitd_client.h"
 #include "platform/result.h"
 #include "platform/value.h"
-#include "xpc/xpc_object.h"
 
 namespace vtr::vitdctl {
+
+struct ValueFree {
+  void operator()(vitd_value* value) const { vitd_value_free(value); }
+};
+// A client-library value that frees itself.
+using UniqueValue = std::unique_ptr<vitd_value, ValueFree>;
 
 // The request dictionary in the file at path ("-" for standard input). JSON
 // when the name ends in ".json" or the text starts with "{" (after white
 // space); a property list otherwise. The top level must be a dictionary.
-Result<XpcObject> ReadRequestFile(const std::string& path);
+Result<UniqueValue> ReadRequestFile(const std::string& path);
 
-// The request dictionary of JSON text: objects become dictionaries, integers
-// int64 (uint64 above INT64_MAX), other numbers doubles.
-Result<XpcObject> RequestFromJson(const std::string& text);
-
-// A property-list value as a message object (dates become nanoseconds since
+// A property-list value as a message value (dates become nanoseconds since
 // 1970, unsigned integers uint64, reals doubles, nil null).
-XpcObject XpcObjectFromValue(const Value& value);
+UniqueValue MessageValueOf(const Value& value);
 
 // One sub-command: the request key it sends and how its arguments become
 // the key's value.
@@ -33,7 +36,7 @@ struct SubCommand {
   const char* summary;   // one line for --help
   // The request's value from the arguments after the name, or an Error
   // describing the misuse.
-  Result<XpcObject> (*parameter)(const std::vector<std::string>& args);
+  Result<UniqueValue> (*parameter)(const std::vector<std::string>& args);
   // The command ends the helper (or the machine): the connection closing
   // without a reply is its success.
   bool endsHelper = false;
@@ -43,8 +46,6 @@ struct SubCommand {
 const std::vector<SubCommand>& SubCommands();
 const SubCommand* FindSubCommand(const std::string& name);
 
-// {"<name>:": parameter}
-XpcObject RequestFor(const SubCommand& command, XpcObject parameter);
 
 }  // namespace vtr::vitdctl
 

@@ -1,50 +1,14 @@
 #include "tools/vitdctl/session.h"
 
-#include <nlohmann/json.hpp>
+#include <sys/stat.h>
 
-#include <cerrno>
-
-#include "platform/base64.h"
-#include "xpc/client.h"
+#include <algorithm>
+#include <cstdlib>
+#include <memory>
+#include <string>
 
 namespace vtr::vitdctl {
 namespace {
-
-using Json = nlohmann::json;
-
-std::string Base64(const XpcBytes& bytes) {
-  std::string out;
-  AppendBase64(bytes, &out);
-  return out;
-}
-
-Json ToJson(const XpcObject& object) {
-  switch (object.type()) {
-    case XpcObject::Type::kNull: return nullptr;
-    case XpcObject::Type::kBool: return *object.boolValue();
-    case XpcObject::Type::kInt64: return *object.int64Value();
-    case XpcObject::Type::kUint64: return *object.uint64Value();
-    case XpcObject::Type::kDouble: return *object.doubleValue();
-    case XpcObject::Type::kDate: return *object.dateValue();
-    case XpcObject::Type::kData: return Base64(*object.data());
-    case XpcObject::Type::kString: return *object.string();
-    case XpcObject::Type::kUuid: {
-      const XpcUuid uuid = *object.uuidValue();
-      return Base64(XpcBytes(uuid.begin(), uuid.end()));
-    }
-    case XpcObject::Type::kArray: {
-      Json array = Json::array();
-      for (const XpcObject& item : *object.array()) array.push_back(ToJson(item));
-      return array;
-    }
-    case XpcObject::Type::kDictionary: {
-      Json dict = Json::object();
-      for (const auto& [key, item] : *object.dictionary()) dict[key] = ToJson(item);
-      return dict;
-    }
-  }
-  return nullptr;
-}
 
 void DrawProgress(FILE* out, int64_t percent) {
   constexpr int kWidth = 40;
@@ -55,59 +19,89 @@ void DrawProgress(FILE* out, int64_t percent) {
   std::fflush(out);
 }
 
-}  // namespace
-
-std::string MessageAsJson(const XpcObject& message) {
-  return ToJson(message).dump(-1, ' ', false, Json::error_handler_t::replace);
+// What a helper that stops answering usually means: after some responses,
+// a request key it does not know; before any, a client it does not entitle.
+void ExplainSilence(size_t responses) {
+  if (responses > 0) {
+    std::fprintf(stderr, "vitdctl: the helper sends no response to a request key it does not know\n");
+    return;
+  }
+  struct stat self;
+  if (::stat("/proc/self/exe", &self) == 0 && (self.st_uid != 0 || (self.st_mode & (S_IWGRP | S_IWOTH)) != 0)) {
+    std::fprintf(stderr,
+                 "vitdctl: this vitdctl is not entitled: the helper honours its entitlement only when the\n"
+                 "  executable is owned by root and not writable by group or others (it is owned by uid %u,\n"
+                 "  mode %03o); install it as root, e.g. mode 0750\n",
+                 static_cast<unsigned>(self.st_uid), static_cast<unsigned>(self.st_mode & 07777));
+    return;
+  }
+  std::fprintf(stderr,
+               "vitdctl: the helper answers nothing to a client that is not entitled (its executable must be\n"
+               "  root-owned, not writable by others, and carry the helper's entitlement) nor to a request\n"
+               "  key it does not know; see the helper's log for the reason\n");
 }
 
-int RunSession(const SessionOptions& options, const XpcObject& request, FILE* out) {
-  Result<XpcClient> client = XpcClient::Connect(options.socketPath);
-  if (!client.ok()) {
-    std::fprintf(stderr, "vitdctl: cannot connect to %s: %s\n", options.socketPath.c_str(),
-                 client.error().description().c_str());
-    return kCannotConnect;
-  }
-  if (Status sent = client->send(request); !sent.ok()) {
-    std::fprintf(stderr, "vitdctl: cannot send the request: %s\n", sent.error().description().c_str());
-    return kCannotConnect;
-  }
-
-  const size_t expected = request.dictionary() ? request.dictionary()->size() : 0;
+struct Progress {
+  const SessionOptions* options;
+  FILE* out;
   size_t responses = 0;
   bool allTrue = true;
   bool barShown = false;
-  while (responses < expected) {
-    Result<XpcObject> message = client->receive(options.timeout);
-    if (!message.ok()) {
-      if (barShown) std::fputc('\n', out);
-      const bool timedOut = message.error().code() == ETIMEDOUT;
-      if (options.closeIsSuccess && !timedOut && responses == 0) {
-        std::fprintf(stderr, "vitdctl: the helper ended the connection without a reply, as this command does\n");
-        return kAllTrue;
-      }
-      std::fprintf(stderr, "vitdctl: %s after %zu of %zu responses\n",
-                   timedOut ? "no answer in time" : "the helper closed the connection", responses, expected);
-      return kIncomplete;
-    }
-    const XpcObject* progress = message->find("Progress");
-    if (options.progressBar && progress != nullptr && progress->int64Value()) {
-      DrawProgress(out, *progress->int64Value());
-      barShown = true;
-      continue;
-    }
-    if (barShown) {
-      std::fputc('\n', out);
-      barShown = false;
-    }
-    std::fprintf(out, "%s\n", MessageAsJson(*message).c_str());
-    std::fflush(out);
-    if (const XpcObject* response = message->find("Response")) {
-      ++responses;
-      if (response->boolValue() != true) allTrue = false;
-    }
+};
+
+int PrintMessage(const vitd_message* message, void* context) {
+  auto* state = static_cast<Progress*>(context);
+  if (state->options->progressBar && message->kind == VITD_MESSAGE_PROGRESS) {
+    DrawProgress(state->out, message->progress);
+    state->barShown = true;
+    return 0;
   }
-  return allTrue ? kAllTrue : kSomeFalse;
+  if (state->barShown) {
+    std::fputc('\n', state->out);
+    state->barShown = false;
+  }
+  char* json = vitd_value_to_json(message->object);
+  std::fprintf(state->out, "%s\n", json != nullptr ? json : "{}");
+  std::free(json);
+  std::fflush(state->out);
+  if (message->kind == VITD_MESSAGE_RESPONSE) {
+    ++state->responses;
+    if (message->response == 0) state->allTrue = false;
+  }
+  return 0;
+}
+
+}  // namespace
+
+int RunSession(const SessionOptions& options, const vitd_value& request, FILE* out) {
+  vitd_client* client = nullptr;
+  if (int status = vitd_connect(options.socketPath.c_str(), &client); status != VITD_OK) {
+    std::fprintf(stderr, "vitdctl: cannot connect to %s: %s\n", options.socketPath.c_str(), vitd_strerror(status));
+    return kCannotConnect;
+  }
+  std::unique_ptr<vitd_client, void (*)(vitd_client*)> owned(client, vitd_disconnect);
+  vitd_set_timeout(client, static_cast<int>(std::min<int64_t>(options.timeout.count(), INT32_MAX)));
+  if (int status = vitd_send_request(client, &request); status != VITD_OK) {
+    std::fprintf(stderr, "vitdctl: cannot send the request: %s\n", vitd_strerror(status));
+    return kCannotConnect;
+  }
+
+  const size_t expected = vitd_value_count(&request);
+  Progress state{&options, out};
+  while (state.responses < expected) {
+    const int status = vitd_receive(client, PrintMessage, &state);
+    if (status == VITD_OK) continue;
+    if (state.barShown) std::fputc('\n', out);
+    if (options.closeIsSuccess && status == VITD_ERROR_CLOSED && state.responses == 0) {
+      std::fprintf(stderr, "vitdctl: the helper ended the connection without a reply, as this command does\n");
+      return kAllTrue;
+    }
+    std::fprintf(stderr, "vitdctl: %s after %zu of %zu responses\n", vitd_strerror(status), state.responses,
+                 expected);
+    if (status == VITD_ERROR_TIMEOUT || status == VITD_ERROR_CLOSED) ExplainSilence(state.responses);
+    return kIncomplete;
+  }
+  return state.allTrue ? kAllTrue : kSomeFalse;
 }
 
 }  // namespace vtr::vitdctl

@@ -7,7 +7,7 @@
 #include <cstdio>
 #include <string>
 
-#include "xpc/xpc_object.h"
+#include "client/vitd_client.h"
 
 namespace vtr::vitdctl {
 
@@ -31,14 +31,12 @@ struct SessionOptions {
   bool closeIsSuccess = false;
 };
 
-// Sends request and prints each message received as one line of JSON to out
-// ({"Response":true}, {"Progress":42}, {"Data":"<base64>"}), until one
-// "Response" per key of the request has come, the helper closes the
-// connection, or the timeout passes. Diagnostics go to standard error.
-int RunSession(const SessionOptions& options, const XpcObject& request, FILE* out);
-
-// One line of JSON for a message the helper sent.
-std::string MessageAsJson(const XpcObject& message);
+// Sends request (a dictionary) and prints each message received as one line
+// of JSON to out ({"Response":true}, {"Progress":42}, {"Data":"<base64>"}),
+// until one "Response" per key of the request has come, the helper closes
+// the connection, or the timeout passes. Diagnostics go to standard error;
+// when the helper stays silent they say what usually causes that.
+int RunSession(const SessionOptions& options, const vitd_value& request, FILE* out);
 
 }  // namespace vtr::vitdctl
 

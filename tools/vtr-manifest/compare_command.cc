@@ -55,7 +55,7 @@ class EntryIndex {
 int RunCompare(const CompareOptions& options, FILE* out, Console& console) {
   Result<std::unique_ptr<ManifestSource>> source = ManifestSource::Load(options.manifest);
   if (!source.ok()) {
-    console.write("vtr-manifest: " + source.error().description());
+    console.print("vtr-manifest: " + source.error().description());
     return kExitError;
   }
   const PlistNode& expected = (*source)->records();
@@ -82,7 +82,7 @@ int RunCompare(const CompareOptions& options, FILE* out, Console& console) {
       },
       console);
   if (!built) {
-    console.write("vtr-manifest: a record of the manifest is too large to build");
+    console.print("vtr-manifest: a record of the manifest is too large to build");
     return kExitError;
   }
   for (uint64_t i = 0; i < expected.count(); ++i) {
@@ -93,7 +93,7 @@ int RunCompare(const CompareOptions& options, FILE* out, Console& console) {
   }
   if (std::fflush(out) != 0) return kExitError;
   if (!filled) {
-    console.write("vtr-manifest: the tree could not be walked to its end");
+    console.print("vtr-manifest: the tree could not be walked to its end");
     return kExitError;
   }
   return differs ? kExitFailure : kExitOk;

@@ -20,7 +20,7 @@ bool IsProgressChatter(std::string_view message) {
 Console::Console(FILE* err, bool drawProgress, bool verbose)
     : err_(err), drawProgress_(drawProgress), verbose_(verbose) {}
 
-void Console::write(std::string_view message) {
+void Console::write(std::string_view message, LogPriority) {
   if (drawProgress_ && !verbose_ && IsProgressChatter(message)) return;
   std::lock_guard<std::mutex> lock(mutex_);
   if (barShown_) std::fputs("\r\033[K", err_);

@@ -25,7 +25,8 @@ class Console final : public SystemLog {
 
   // One message on its own line (the bar, if any, is drawn again below it).
   // May be called from any thread.
-  void write(std::string_view message) override;
+  void write(std::string_view message, LogPriority priority) override;
+  void print(std::string_view message) { write(message, LogPriority::kNotice); }
   // Draws the bar at percent (shown capped at 100).
   void showProgress(int64_t percent);
   // Ends the bar's line, if one was drawn.

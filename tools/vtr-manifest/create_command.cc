@@ -9,7 +9,7 @@ namespace vtr::manifest_tool {
 int RunCreate(const CreateOptions& options, Console& console) {
   Result<std::unique_ptr<ManifestFileWriter>> writer = ManifestFileWriter::Create(options.output);
   if (!writer.ok()) {
-    console.write("vtr-manifest: cannot create " + options.output + ": " + writer.error().description());
+    console.print("vtr-manifest: cannot create " + options.output + ": " + writer.error().description());
     return kExitError;
   }
   // As the helper does for the device manifest: a tree that holds the output
@@ -17,11 +17,11 @@ int RunCreate(const CreateOptions& options, Console& console) {
   WalkOptions walk = options.walk;
   walk.skip.push_back((*writer)->temporaryPath());
   if (!RunWalk(walk, (*writer)->handler(), console)) {
-    console.write("vtr-manifest: the manifest could not be made; " + options.output + " is left as it was");
+    console.print("vtr-manifest: the manifest could not be made; " + options.output + " is left as it was");
     return kExitError;
   }
   if (Status committed = (*writer)->commit(); !committed.ok()) {
-    console.write("vtr-manifest: cannot write " + options.output + ": " + committed.error().description());
+    console.print("vtr-manifest: cannot write " + options.output + ": " + committed.error().description());
     return kExitError;
   }
   return kExitOk;

@@ -82,12 +82,12 @@ void PrintText(const Json& d, FILE* out) {
 int RunInspect(const InspectOptions& options, FILE* out, Console& console) {
   Result<std::string> bytes = ReadWholeFile(options.file);
   if (!bytes.ok()) {
-    console.write("vtr-manifest: " + bytes.error().description());
+    console.print("vtr-manifest: " + bytes.error().description());
     return kExitError;
   }
   std::optional<VTRSignedManifest> manifest = VTRSignedManifest::unverifiedManifestWithBytes(std::move(*bytes));
   if (!manifest) {
-    console.write("vtr-manifest: " + options.file + " is not a signed manifest this tool can read");
+    console.print("vtr-manifest: " + options.file + " is not a signed manifest this tool can read");
     return kExitError;
   }
   const Json description = Describe(*manifest);

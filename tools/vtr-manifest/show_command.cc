@@ -39,19 +39,19 @@ bool PrintEntries(const PlistNode& records, ShowFormat format, FILE* out) {
 int RunShow(const ShowOptions& options, FILE* out, Console& console) {
   Result<std::unique_ptr<ManifestSource>> source = ManifestSource::Load(options.manifest);
   if (!source.ok()) {
-    console.write("vtr-manifest: " + source.error().description());
+    console.print("vtr-manifest: " + source.error().description());
     return kExitError;
   }
   PlistNode records = (*source)->records();
   if (options.path) {
     const PlistNode record = records.get(*options.path);
     if (record.isNil()) {
-      console.write("vtr-manifest: the manifest has no entry " + *options.path);
+      console.print("vtr-manifest: the manifest has no entry " + *options.path);
       return kExitFailure;
     }
     Result<Value> value = record.value();
     if (!value.ok()) {
-      console.write("vtr-manifest: " + value.error().description());
+      console.print("vtr-manifest: " + value.error().description());
       return kExitError;
     }
     records = PlistNode(Value::DictionaryOf({{*options.path, *value}}));
@@ -61,12 +61,12 @@ int RunShow(const ShowOptions& options, FILE* out, Console& console) {
     Result<Value> manifest = records.value();
     Result<std::string> xml = manifest.ok() ? EncodeXmlPropertyList(*manifest) : Result<std::string>(manifest.error());
     if (!xml.ok()) {
-      console.write("vtr-manifest: cannot show the manifest as XML: " + xml.error().description());
+      console.print("vtr-manifest: cannot show the manifest as XML: " + xml.error().description());
       return kExitError;
     }
     std::fputs(xml->c_str(), out);
   } else if (!PrintEntries(records, options.format, out)) {
-    console.write("vtr-manifest: a record of the manifest is too large to build");
+    console.print("vtr-manifest: a record of the manifest is too large to build");
     return kExitError;
   }
   return std::fflush(out) == 0 ? kExitOk : kExitError;

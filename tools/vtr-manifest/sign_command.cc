@@ -91,7 +91,7 @@ Status Sign(const SignOptions& options) {
 
 int RunSign(const SignOptions& options, Console& console) {
   if (Status signed_ = Sign(options); !signed_.ok()) {
-    console.write("vtr-manifest: " + signed_.error().description());
+    console.print("vtr-manifest: " + signed_.error().description());
     return kExitError;
   }
   return kExitOk;

@@ -7,7 +7,7 @@ namespace vtr::manifest_tool {
 int RunVerify(const VerifyOptions& options, FILE* out, Console& console) {
   Result<std::string> bytes = ReadWholeFile(options.file);
   if (!bytes.ok()) {
-    console.write("vtr-manifest: " + bytes.error().description());
+    console.print("vtr-manifest: " + bytes.error().description());
     return kExitError;
   }
   // The helper's own messages reach the console through the log.
@@ -33,11 +33,11 @@ int RunVerify(const VerifyOptions& options, FILE* out, Console& console) {
   };
   for (const auto& cause : kCauses) {
     if (cause.failure == failure) {
-      console.write("vtr-manifest: " + options.file + " is not trusted: " + cause.why);
+      console.print("vtr-manifest: " + options.file + " is not trusted: " + cause.why);
       return cause.status;
     }
   }
-  console.write("vtr-manifest: " + options.file + " is not a well-formed signed manifest");
+  console.print("vtr-manifest: " + options.file + " is not a well-formed signed manifest");
   return kExitMalformed;
 }
 
