@@ -1,0 +1,113 @@
+#!/usr/bin/env bash
+# Boots this machine's own userspace in a container (systemd-nspawn, systemd
+# as PID 1) over an overlay that holds an install of the build, then checks
+# the units as shipped: systemd-analyze verify, socket activation, the
+# confinement the running helper really has, every command through vitdctl
+# and the example client, failures at error priority in the journal, quit and
+# restart through the socket, and finally a reboot of the container.
+#
+#   systemd_units_test.sh BUILD_DIR            the build, as cmake --install lays it out
+#   systemd_units_test.sh BUILD_DIR DEB...     the Debian packages instead, installed
+#                                              with dpkg; the example client is then
+#                                              built through pkg-config
+set -uo pipefail
+build=${1:?usage: systemd_units_test.sh BUILD_DIR [DEB...]}
+shift
+debs=("$@")
+here=$(cd "$(dirname "$0")" && pwd)
+
+skip() { echo "SKIP: $*"; exit 77; }
+[ "$(id -u)" -eq 0 ] || skip "needs root (overlay mount, systemd-nspawn)"
+command -v systemd-nspawn >/dev/null || skip "systemd-nspawn is missing (package systemd-container)"
+[ -x /lib/systemd/systemd ] || skip "systemd is not installed"
+grep -qw overlay /proc/filesystems || modprobe overlay 2>/dev/null || skip "no overlayfs"
+[ -x "$build/bin/vitd_helper" ] || skip "$build/bin/vitd_helper is not built"
+
+work=$(mktemp -d /tmp/vitd-units.XXXXXX)
+nspawn_pid=
+cleanup() {
+  if [ -n "$nspawn_pid" ] && kill -0 "$nspawn_pid" 2>/dev/null; then
+    kill -TERM "$nspawn_pid" 2>/dev/null
+    for _ in $(seq 50); do kill -0 "$nspawn_pid" 2>/dev/null || break; sleep 0.1; done
+    kill -KILL "$nspawn_pid" 2>/dev/null
+  fi
+  umount -l "$work/root" 2>/dev/null
+  rm -rf "$work"
+}
+trap cleanup EXIT
+
+mkdir -p "$work"/{upper,overlay-work,root}
+if [ ${#debs[@]} -eq 0 ]; then
+  # The install, as `cmake --install` makes it, in the overlay's upper layer.
+  DESTDIR="$work/upper" cmake --install "$build" >/dev/null || { echo "FAIL: cmake --install"; exit 1; }
+  cp "$build/bin/vitd-example" "$work/upper/usr/local/bin/"
+fi
+mount -t overlay overlay -o "lowerdir=/,upperdir=$work/upper,workdir=$work/overlay-work" "$work/root" ||
+  skip "cannot mount an overlay of /"
+root=$work/root
+
+if [ ${#debs[@]} -eq 0 ]; then
+  # What the package's scripts do.
+  chroot "$root" /bin/sh -e -c '
+    groupadd --system vitd
+    chgrp vitd /usr/local/bin/vitdctl && chmod 0750 /usr/local/bin/vitdctl
+    systemctl enable vitd_helper.socket >/dev/null 2>&1' || { echo "FAIL: setting up the install"; exit 1; }
+else
+  # The packages, then the example client built as its README says.
+  mkdir -p "$root/tmp/debs" && cp "${debs[@]}" "$root/tmp/debs/"
+  chroot "$root" /bin/sh -e -c '
+    dpkg -i /tmp/debs/*.deb >/tmp/dpkg.log 2>&1 || { cat /tmp/dpkg.log; exit 1; }
+    cc -o /usr/local/bin/vitd-example /usr/share/doc/libvitdclient-dev/examples/vitd-example.c \
+      $(pkg-config --cflags --libs vitdclient)
+    objcopy --add-section .vtr_entitlements="$(pkg-config --variable=entitlement vitdclient)" \
+      --set-section-flags .vtr_entitlements=readonly /usr/local/bin/vitd-example' ||
+    { echo "FAIL: installing the packages"; exit 1; }
+fi
+
+# The device's accounts and data area.
+chroot "$root" /bin/sh -e -c '
+  groupadd -g 501 mobile && useradd -u 501 -g 501 -d /var/mobile -M mobile
+  useradd -M -G vitd demo
+  mkdir -p /private/var/root/Library/Preferences /private/var/mobile/Library/Preferences /private/var/logs
+  mkdir -p /private/var/mobile/Media/DCIM /usr/share/vitd/anchors/production
+  printf "<plist version=\"1.0\"><dict><key>DemoMode</key><true/></dict></plist>\n" \
+    > /private/var/root/Library/Preferences/com.orvane.Vitrell.plist
+  printf "a photo" > /private/var/mobile/Media/DCIM/IMG_0001.JPG
+  systemctl mask systemd-firstboot.service systemd-networkd.service >/dev/null 2>&1 || true
+' || { echo "FAIL: preparing the container's root"; exit 1; }
+cp "$here/in_container_checks.sh" "$root/root/checks.sh"
+
+systemd-nspawn -q -D "$root" --register=no --keep-unit -M vitd-units --boot -- systemd.firstboot=off > "$work/console.log" 2>&1 &
+nspawn_pid=$!
+
+# The container's PID 1, seen from here.
+leader=
+for _ in $(seq 100); do
+  leader=$(pgrep -P "$nspawn_pid" | head -n 1)
+  [ -n "$leader" ] && [ "$(cat /proc/"$leader"/comm 2>/dev/null)" = systemd ] && break
+  sleep 0.1
+done
+[ -n "$leader" ] || { echo "FAIL: the container did not start"; cat "$work/console.log"; exit 1; }
+inside() { nsenter -t "$leader" -m -u -i -n -p -- "$@"; }
+for _ in $(seq 300); do
+  state=$(inside systemctl is-system-running 2>/dev/null)
+  case $state in running|degraded) break ;; esac
+  sleep 0.2
+done
+echo "container: $state"
+
+# The checks end by asking for a reboot, which also ends them.
+{ inside bash /root/checks.sh; } 2>/dev/null  # the shell would report the kill
+if [ "$(cat "$root/root/checks.result" 2>/dev/null)" != passed ]; then
+  echo "FAIL: checks inside the container failed"
+  exit 1
+fi
+
+# The last check asked the helper to reboot: the container ends with it.
+for _ in $(seq 150); do kill -0 "$nspawn_pid" 2>/dev/null || break; sleep 0.2; done
+if kill -0 "$nspawn_pid" 2>/dev/null; then echo "FAIL: the container did not reboot"; exit 1; fi
+wait "$nspawn_pid"; code=$?
+# systemd-nspawn exits 133 when the container rebooted.
+[ $code -eq 133 ] || { echo "FAIL: systemd-nspawn ended with $code, not 133 (reboot)"; tail -n 20 "$work/console.log"; exit 1; }
+nspawn_pid=
+echo "PASS: the confined helper served every command and rebooted the container"
