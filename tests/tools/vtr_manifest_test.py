@@ -169,8 +169,40 @@ class CreateTest(unittest.TestCase):
 
     def test_unwritable_output_fails_and_writes_nothing(self):
         result = run("create", self.root, "-o", os.path.join(self.tmp, "absent", "m.plist"))
-        self.assertEqual(result.returncode, 2)
+        self.assertEqual(result.returncode, 74)
         self.assertFalse(os.path.exists(os.path.join(self.tmp, "absent")))
+
+    def test_bad_input_is_an_error_never_an_empty_manifest(self):
+        out = os.path.join(self.tmp, "m.plist")
+        a_file = os.path.join(self.root, "plain")
+        with open(a_file, "w") as f:
+            f.write("x")
+        cases = (
+            (["create", os.path.join(self.tmp, "missing"), "-o", out], 66, "No such file or directory"),
+            (["create", a_file, "-o", out], 65, "is not a directory: a manifest describes a tree"),
+            (["create", self.root, "--relative-to", os.path.join(self.tmp, "elsewhere"), "-o", out], 64,
+             "must be " + self.root + " or a folder above it"),
+            (["create", self.root, "--skip", self.tmp, "-o", out], 64, "does not lie inside"),
+            (["create", self.root, "--skip", self.root + "/", "-o", out], 64, "does not lie inside"),
+            (["compare", a_file, os.path.join(self.tmp, "missing")], 66, "No such file or directory"),
+        )
+        for args, status, message in cases:
+            with self.subTest(args=args):
+                result = run(*args)
+                self.assertEqual(result.returncode, status, result.stderr)
+                self.assertIn(message, result.stderr.decode())
+                self.assertFalse(os.path.exists(out))
+        # A folder above the tree, and a skip inside it, are fine.
+        self.assertEqual(run("create", self.root, "--relative-to", self.tmp, "--skip", a_file, "-o", out).returncode, 0)
+        # A property list that is not a manifest is refused where one is read.
+        other = os.path.join(self.tmp, "other.plist")
+        with open(other, "wb") as f:
+            plistlib.dump({"DemoMode": True}, f)
+        for args in (["show", other], ["compare", other, self.root]):
+            result = run(*args)
+            self.assertEqual(result.returncode, 65, args)
+            self.assertIn(b"is not a manifest", result.stderr)
+        self.assertRegex(run("--version").stdout.decode(), r"^vtr-manifest \(vitd\) \d+\.\d+\n$")
 
 
 class ShowAndCompareTest(unittest.TestCase):
@@ -226,7 +258,7 @@ class ShowAndCompareTest(unittest.TestCase):
         app = run("show", path, "--container", "com.example.app").stdout.decode().splitlines()
         self.assertEqual(len(app), 1)
         self.assertTrue(app[0].endswith(" /Documents"))
-        self.assertEqual(run("show", path, "--container", "unknown").returncode, 2)
+        self.assertEqual(run("show", path, "--container", "unknown").returncode, 65)
 
     def test_compare_names_each_difference(self):
         self.assertEqual(self.compare(), (0, []))
@@ -362,7 +394,7 @@ class SignedManifestTest(unittest.TestCase):
              "signed manifest version 3 is not supported yet"),
             ("no certificates", self.rewritten(signed, "nocert.plist", lambda o: o.pop("Certificate")), None, 3,
              "cannot find certificates, or certificate format not correct."),
-            ("not a property list", self.manifest + ".missing", None, 2, "No such file"),
+            ("not a property list", self.manifest + ".missing", None, 66, "No such file"),
         ]
         garbage = os.path.join(self.tmp, "garbage.plist")
         with open(garbage, "wb") as f:
@@ -392,7 +424,7 @@ class SignedManifestTest(unittest.TestCase):
         text = run("inspect", signed).stdout.decode()
         self.assertIn("certificate 0: CN=tool signer", text)
         self.assertIn(f"appData com.example.app: {count} records", text)
-        self.assertEqual(run("inspect", self.manifest).returncode, 2)
+        self.assertEqual(run("inspect", self.manifest).returncode, 65)
 
     def test_sign_refuses_what_it_cannot_use(self):
         signed = self.sign("refuse.plist")
@@ -401,7 +433,7 @@ class SignedManifestTest(unittest.TestCase):
                      ["--key", self.key, "--certificate", self.cert, "--app-data", f"a={signed}"]):  # signed
             with self.subTest(args=args):
                 result = run("sign", self.manifest, "-o", os.path.join(self.tmp, "never.plist"), *args)
-                self.assertEqual(result.returncode, 2, result.stderr)
+                self.assertEqual(result.returncode, 65, result.stderr)
                 self.assertFalse(os.path.exists(os.path.join(self.tmp, "never.plist")))
         for args in (["sign", self.manifest, "-o", "x"], ["sign", self.manifest, "--key", self.key, "-o", "x"],
                      ["sign", self.manifest, "--key", self.key, "--certificate", self.cert, "-o", "x",

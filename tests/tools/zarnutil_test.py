@@ -120,15 +120,30 @@ class ZarnutilTest(unittest.TestCase):
         write_at(self.image, 200, b"\xff")
         write_at(self.image, 16 * MIB - 4096 + 200, b"\xff")
         result = run("check", self.image)
-        self.assertEqual((result.returncode, result.stderr), (1, "zarn: media header corrupt\n"))
+        self.assertEqual((result.returncode, result.stderr), (65, "zarn: media header corrupt\n"))
 
     def test_repair_strict_and_lenient(self):
         h = self.create()
-        result = run("repair", "--strict", self.image)
+        # A header that passes the check is left alone unless forced.
+        for args in (("repair", self.image), ("repair", "--strict", self.image)):
+            result = run(*args)
+            self.assertEqual(result.returncode, 0, result.stderr)
+            self.assertIn("passes the check; nothing written", result.stderr)
+        self.assertEqual(json.loads(run("repair", "--json", self.image).stdout),
+                         {"image": self.image, "consistent": True, "repaired": False, "bytes_changed": 0,
+                          "written": False})
+        self.assertEqual(read_at(self.image, 0), h)
+        # Forced, the library's own rules hold: its order test takes a fresh
+        # header's partition as faulty (strict fails, lenient rewrites).
+        result = run("repair", "--strict", "--force", self.image)
         self.assertEqual(result.returncode, 1)
         self.assertEqual(result.stderr, "zarn: partition 0 start/end not in order\nzarn: partition table corrupt\n")
         self.assertEqual(read_at(self.image, 0), h)  # nothing written
-        result = run("repair", self.image)
+        result = run("repair", "--force", "--dry-run", self.image)
+        self.assertEqual(result.returncode, 0, result.stderr)
+        self.assertRegex(result.stderr, r"the repair would change \d+ bytes of the header; nothing written")
+        self.assertEqual(read_at(self.image, 0), h)
+        result = run("repair", "--force", self.image)
         self.assertEqual(result.returncode, 0, result.stderr)
         self.assertEqual(result.stderr.count("not assigned to valid partition\n"), 1023)
         repaired = read_at(self.image, 0)
@@ -136,6 +151,18 @@ class ZarnutilTest(unittest.TestCase):
         self.assertEqual(struct.unpack_from("<I", repaired, 44)[0], crc_of(repaired))
         self.assertEqual(read_at(self.image, 16 * MIB - 4096), repaired)
         self.assertEqual(run("check", self.image).returncode, 0)
+
+    def test_create_keeps_an_existing_header_unless_forced(self):
+        h = self.create()
+        result = run("create", self.image)
+        self.assertEqual(result.returncode, 65)
+        self.assertIn("a Zarn header is already there; --force replaces it", result.stderr)
+        result = run("create", "--dry-run", "--force", self.image)
+        self.assertEqual(result.returncode, 0, result.stderr)
+        self.assertIn("would write a fresh header", result.stderr)
+        self.assertEqual(read_at(self.image, 0), h)
+        self.assertEqual(run("create", "--force", self.image).returncode, 0)
+        self.assertNotEqual(read_at(self.image, 0), h)  # a new media identity
 
     def test_export_and_map(self):
         self.create()
@@ -178,8 +205,8 @@ class ZarnutilTest(unittest.TestCase):
         self.assertEqual(run("--block-size=16384", "check", self.image).returncode, 0)
         for size, message in (("4095", "zarn: media block size too small\n"),
                               ("16385", "zarn: media block size too large\n")):
-            result = run("--block-size", size, "create", self.image)
-            self.assertEqual((result.returncode, result.stderr), (1, message))
+            result = run("--block-size", size, "create", "--force", self.image)
+            self.assertEqual((result.returncode, result.stderr), (65, message))
 
     def gpt_disk(self, entries, blocks=65536, signed=True):
         """A 4096-byte-block disk image with a GPT of entries (name, first, count) and both copies."""
@@ -225,15 +252,23 @@ class ZarnutilTest(unittest.TestCase):
         self.assertFalse(disk["gptValid"])
         self.assertFalse(disk["zarnSignature"])
 
-    def test_usage(self):
+    def test_usage_and_exit_statuses(self):
         self.assertEqual(run("--help").returncode, 0)
         self.assertIn("usage: zarnutil", run("--help").stdout)
+        self.assertRegex(run("--version").stdout, r"^zarnutil \(vitd\) \d+\.\d+\n$")
         for args in ((), ("frobnicate", self.image), ("show",), ("show", "--strict", self.image),
-                     ("--block-size", "0", "show", self.image), ("check", self.image, self.image)):
-            self.assertEqual(run(*args).returncode, 2, args)
-        result = run("show", self.dir.name)
-        self.assertEqual(result.returncode, 1)
+                     ("--block-size", "0", "show", self.image), ("check", self.image, self.image),
+                     ("map", "--json", self.image), ("show", "--bogus", self.image), ("show", self.image, "--block-size")):
+            result = run(*args)
+            self.assertEqual(result.returncode, 64, args)
+            self.assertIn("Try 'zarnutil --help'.", result.stderr)
+        result = run("show", self.dir.name)  # a folder is no medium
+        self.assertEqual(result.returncode, 65)
         self.assertIn("zarnutil: ", result.stderr)
+        self.assertEqual(run("show", self.dir.name + "/missing").returncode, 66)
+        self.create()
+        check = run("check", "--json", self.image)
+        self.assertEqual((check.returncode, json.loads(check.stdout)), (0, {"image": self.image, "consistent": True}))
 
 
 if __name__ == "__main__":

@@ -78,7 +78,7 @@ TEST_F(ServiceTest, OnlyAnEntitledClientIsServed) {
   };
   for (const Case& c : refused) {
     HelperSandbox::RunResult r = vitdctl(c.executable, {"prepareWorkContainer", "/private/var/U"});
-    EXPECT_EQ(r.status, 2) << c.executable;  // no answer at all
+    EXPECT_EQ(r.status, 75) << c.executable;  // no answer at all
     EXPECT_EQ(r.output, "") << c.executable;
     // vitdctl says what usually causes the silence.
     EXPECT_NE(r.errors.find("not entitled"), std::string::npos) << r.errors;
@@ -164,7 +164,7 @@ TEST_F(ServiceTest, TheExampleClientAndVitdctlDriveTheHelperThroughTheClientLibr
   TempDir dir;
   WriteFile(dir / "request.json", R"({"prepareWorkContainer:": "/private/var/F", "zzz:": true})");
   HelperSandbox::RunResult partial = vitdctl(VitdctlExecutable(), {"send", dir / "request.json"});
-  EXPECT_EQ(partial.status, 2);
+  EXPECT_EQ(partial.status, 75);
   EXPECT_EQ(partial.output, "{\"Response\":true}\n");
   EXPECT_NE(partial.errors.find("after 1 of 2 responses"), std::string::npos) << partial.errors;
   EXPECT_NE(partial.errors.find("a request key it does not know"), std::string::npos) << partial.errors;

@@ -2,6 +2,7 @@
 #include <getopt.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <cstdio>
 #include <cstdlib>
 #include <string>
@@ -44,19 +45,21 @@ void PrintUsage(FILE* out) {
                "  --root DIR     talk to a helper running with --root DIR\n"
                "  --socket PATH  the helper's socket (default %s)\n"
                "  --timeout S    seconds to wait for the next message (default 60)\n"
-               "  --help         show this text\n"
+               "  -h, --help     show this text\n"
+               "  -V, --version  show the version\n"
                "\n"
                "Exit status: 0 every response true (reboot and quitHelper: also the helper\n"
-               "closing the connection without a reply), 1 a response false, 2 no complete\n"
-               "answer (timeout or connection closed), 3 cannot connect (listNvram: cannot\n"
-               "read the variables), 64 usage error.\n",
+               "closing the connection without a reply), 1 a response false, 64 usage error,\n"
+               "65 a request file that is not a dictionary, 66 a request file (listNvram: the\n"
+               "variables) that cannot be read, 69 cannot connect, 75 no complete answer\n"
+               "(timeout or connection closed).\n",
                kDefaultSocket);
 }
 
 [[noreturn]] void UsageError(const std::string& message) {
   std::fprintf(stderr, "vitdctl: %s\n", message.c_str());
   std::fprintf(stderr, "Try 'vitdctl --help'.\n");
-  std::exit(kUsage);
+  std::exit(kExitUsage);
 }
 
 }  // namespace
@@ -65,14 +68,15 @@ int main(int argc, char** argv) {
   static const struct option kLongOptions[] = {
       {"root", required_argument, nullptr, 'r'},     {"socket", required_argument, nullptr, 's'},
       {"timeout", required_argument, nullptr, 't'},  {"help", no_argument, nullptr, 'h'},
-      {nullptr, 0, nullptr, 0},
+      {"version", no_argument, nullptr, 'V'},        {nullptr, 0, nullptr, 0},
   };
   SessionOptions options;
   options.socketPath = kDefaultSocket;
   std::string root, socket;
   int c;
   // "+": options end at the command, so command arguments may start with '-'.
-  while ((c = getopt_long(argc, argv, "+", kLongOptions, nullptr)) != -1) {
+  opterr = 0;
+  while ((c = getopt_long(argc, argv, "+:hV", kLongOptions, nullptr)) != -1) {
     switch (c) {
       case 'r': root = optarg; break;
       case 's': socket = optarg; break;
@@ -86,7 +90,9 @@ int main(int argc, char** argv) {
         break;
       }
       case 'h': PrintUsage(stdout); return 0;
-      default: UsageError("unknown option");
+      case 'V': PrintVersion("vitdctl"); return 0;
+      case ':': UsageError(std::string(argv[optind - 1]) + " needs a value");
+      default: UsageError("unknown option " + std::string(argv[optind - 1]));
     }
   }
   if (!root.empty() && !socket.empty()) UsageError("--root and --socket exclude each other");
@@ -106,7 +112,10 @@ int main(int argc, char** argv) {
   if (command == "send") {
     if (args.size() != 1) UsageError("send takes one FILE (or - for standard input)");
     vtr::Result<UniqueValue> read = ReadRequestFile(args[0]);
-    if (!read.ok()) UsageError("cannot read the request: " + read.error().description());
+    if (!read.ok()) {
+      std::fprintf(stderr, "vitdctl: cannot read the request: %s\n", read.error().description().c_str());
+      return read.error().code() == ENOENT || read.error().code() == EACCES ? kExitNoInput : kExitBadInput;
+    }
     request = std::move(read).value();
   } else if (const SubCommand* sub = FindSubCommand(command)) {
     vtr::Result<UniqueValue> parameter = sub->parameter(args);

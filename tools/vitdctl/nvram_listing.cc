@@ -36,7 +36,7 @@ int ListNvram(const std::string& root, bool json, FILE* out) {
   if (!variables.ok()) {
     std::fprintf(stderr, "vitdctl: cannot read the firmware variables in %s%s: %s\n", root.c_str(),
                  kEfiVariablesFolder, variables.error().description().c_str());
-    return kCannotConnect;
+    return kExitNoInput;
   }
   if (json) {
     nlohmann::json list = nlohmann::json::array();

@@ -77,13 +77,13 @@ int RunSession(const SessionOptions& options, const vitd_value& request, FILE* o
   vitd_client* client = nullptr;
   if (int status = vitd_connect(options.socketPath.c_str(), &client); status != VITD_OK) {
     std::fprintf(stderr, "vitdctl: cannot connect to %s: %s\n", options.socketPath.c_str(), vitd_strerror(status));
-    return kCannotConnect;
+    return kExitUnavailable;
   }
   std::unique_ptr<vitd_client, void (*)(vitd_client*)> owned(client, vitd_disconnect);
   vitd_set_timeout(client, static_cast<int>(std::min<int64_t>(options.timeout.count(), INT32_MAX)));
   if (int status = vitd_send_request(client, &request); status != VITD_OK) {
     std::fprintf(stderr, "vitdctl: cannot send the request: %s\n", vitd_strerror(status));
-    return kCannotConnect;
+    return kExitUnavailable;
   }
 
   const size_t expected = vitd_value_count(&request);
@@ -94,14 +94,14 @@ int RunSession(const SessionOptions& options, const vitd_value& request, FILE* o
     if (state.barShown) std::fputc('\n', out);
     if (options.closeIsSuccess && status == VITD_ERROR_CLOSED && state.responses == 0) {
       std::fprintf(stderr, "vitdctl: the helper ended the connection without a reply, as this command does\n");
-      return kAllTrue;
+      return kExitOk;
     }
     std::fprintf(stderr, "vitdctl: %s after %zu of %zu responses\n", vitd_strerror(status), state.responses,
                  expected);
     if (status == VITD_ERROR_TIMEOUT || status == VITD_ERROR_CLOSED) ExplainSilence(state.responses);
-    return kIncomplete;
+    return kExitNoAnswer;
   }
-  return state.allTrue ? kAllTrue : kSomeFalse;
+  return state.allTrue ? kExitOk : kExitNo;
 }
 
 }  // namespace vtr::vitdctl

@@ -8,17 +8,15 @@
 #include <string>
 
 #include "client/vitd_client.h"
+#include "tools/common/tool_conventions.h"
 
 namespace vtr::vitdctl {
 
-// Exit statuses of vitdctl.
-enum ExitStatus : int {
-  kAllTrue = 0,         // every "Response" was true
-  kSomeFalse = 1,       // at least one "Response" was false
-  kIncomplete = 2,      // timeout or closed connection before every response came
-  kCannotConnect = 3,   // nothing listens at the socket
-  kUsage = 64,          // bad command line or request file
-};
+// Exit statuses of vitdctl, the tools' common ones: every "Response" true
+// (kExitOk), one false (kExitNo), a timeout or closed connection before every
+// response came (kExitNoAnswer), nothing listening (kExitUnavailable), a bad
+// command line (kExitUsage) or request file (kExitBadInput, kExitNoInput).
+using namespace vtr::tools;
 
 struct SessionOptions {
   std::string socketPath;

@@ -150,7 +150,8 @@ Status SetOperands(CommandLine& c, const std::vector<std::string>& operands) {
       break;
     case Command::kVerify: c.verify.file = operands[0]; break;
     case Command::kInspect: c.inspect.file = operands[0]; break;
-    case Command::kHelp: break;
+    case Command::kHelp:
+    case Command::kVersion: break;
   }
   return Status::Ok();
 }
@@ -162,6 +163,10 @@ Result<CommandLine> ParseCommandLine(const std::vector<std::string>& arguments) 
   if (arguments.empty()) return Error::Invalid("no command given");
   const std::string& word = arguments[0];
   if (word == "--help" || word == "-h" || word == "help") return c;
+  if (word == "--version" || word == "-V") {
+    c.command = Command::kVersion;
+    return c;
+  }
   size_t operandCount = 0;
   bool known = false;
   for (const auto& command : kCommands) {
@@ -255,12 +260,15 @@ void PrintUsage(FILE* out) {
       "Options:\n"
       "  --jobs N     threads reading files (0: one item at a time on the main thread)\n"
       "  --verbose    show every message of the builder, progress messages included\n"
-      "  --help       show this text\n"
+      "  -h, --help     show this text\n"
+      "  -V, --version  show the version\n"
       "\n"
       "Exit status: 0 success (compare: the tree matches; verify: trusted), 1 compare\n"
-      "found differences or show found no such entry, 2 the work could not be done,\n"
-      "verify: 3 malformed, 4 unsupported version, 5 chain not trusted, 6 bad\n"
-      "signature; 64 usage error.\n",
+      "found differences or show found no such entry; verify: 3 malformed, 4\n"
+      "unsupported version, 5 chain not trusted, 6 bad signature; 64 usage error,\n"
+      "65 an input that is not what it must be (a file where a tree belongs, a\n"
+      "property list that is no manifest), 66 an input that is missing or cannot be\n"
+      "read, 74 reading a tree or writing the output failed.\n",
       out);
 }
 

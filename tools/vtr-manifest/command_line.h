@@ -12,7 +12,7 @@
 namespace vtr::manifest_tool {
 
 struct CommandLine {
-  enum class Command { kHelp, kCreate, kShow, kCompare, kSign, kVerify, kInspect } command = Command::kHelp;
+  enum class Command { kHelp, kVersion, kCreate, kShow, kCompare, kSign, kVerify, kInspect } command = Command::kHelp;
   bool verbose = false;
   CreateOptions create;
   ShowOptions show;

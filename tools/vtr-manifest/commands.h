@@ -11,19 +11,20 @@
 #include <vector>
 
 #include "model/signed_manifest.h"
+#include "tools/common/tool_conventions.h"
 #include "tools/vtr-manifest/console.h"
 
 namespace vtr::manifest_tool {
 
-inline constexpr int kExitOk = 0;
-inline constexpr int kExitFailure = 1;  // compare: the tree differs from the manifest
-inline constexpr int kExitError = 2;    // the command could not do its work
-// verify, by cause: what keeps a signed manifest from being trusted.
+// The tools' common exit statuses (kExitOk; kExitNo: compare found
+// differences, show no such entry; kExitUsage, kExitBadInput, kExitNoInput,
+// kExitIoError), and verify's own, by cause: what keeps a signed manifest
+// from being trusted.
+using namespace vtr::tools;
 inline constexpr int kExitMalformed = 3;           // not a signed manifest of the expected form
 inline constexpr int kExitUnsupportedVersion = 4;  // outer or payload version not read
 inline constexpr int kExitNotTrusted = 5;          // no policy trusts the certificate chain
 inline constexpr int kExitBadSignature = 6;        // the signature does not sign the payload
-inline constexpr int kExitUsage = 64;
 
 // What is walked, and how, for create and compare.
 struct WalkOptions {

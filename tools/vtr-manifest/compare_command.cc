@@ -53,10 +53,11 @@ class EntryIndex {
 }  // namespace
 
 int RunCompare(const CompareOptions& options, FILE* out, Console& console) {
+  if (int checked = CheckWalkOptions(options.walk, console); checked != kExitOk) return checked;
   Result<std::unique_ptr<ManifestSource>> source = ManifestSource::Load(options.manifest);
   if (!source.ok()) {
     console.print("vtr-manifest: " + source.error().description());
-    return kExitError;
+    return ExitStatusOfLoad(source.error());
   }
   const PlistNode& expected = (*source)->records();
   EntryIndex index(expected);
@@ -83,7 +84,7 @@ int RunCompare(const CompareOptions& options, FILE* out, Console& console) {
       console);
   if (!built) {
     console.print("vtr-manifest: a record of the manifest is too large to build");
-    return kExitError;
+    return kExitBadInput;
   }
   for (uint64_t i = 0; i < expected.count(); ++i) {
     if (index.met(i)) continue;
@@ -91,12 +92,12 @@ int RunCompare(const CompareOptions& options, FILE* out, Console& console) {
                  EscapedText(expected.keyAt(i)).c_str());
     differs = true;
   }
-  if (std::fflush(out) != 0) return kExitError;
+  if (std::fflush(out) != 0) return kExitIoError;
   if (!filled) {
     console.print("vtr-manifest: the tree could not be walked to its end");
-    return kExitError;
+    return kExitIoError;
   }
-  return differs ? kExitFailure : kExitOk;
+  return differs ? kExitNo : kExitOk;
 }
 
 }  // namespace vtr::manifest_tool

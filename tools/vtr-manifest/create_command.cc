@@ -7,10 +7,11 @@
 namespace vtr::manifest_tool {
 
 int RunCreate(const CreateOptions& options, Console& console) {
+  if (int checked = CheckWalkOptions(options.walk, console); checked != kExitOk) return checked;
   Result<std::unique_ptr<ManifestFileWriter>> writer = ManifestFileWriter::Create(options.output);
   if (!writer.ok()) {
     console.print("vtr-manifest: cannot create " + options.output + ": " + writer.error().description());
-    return kExitError;
+    return kExitIoError;
   }
   // As the helper does for the device manifest: a tree that holds the output
   // does not describe it half written.
@@ -18,11 +19,11 @@ int RunCreate(const CreateOptions& options, Console& console) {
   walk.skip.push_back((*writer)->temporaryPath());
   if (!RunWalk(walk, (*writer)->handler(), console)) {
     console.print("vtr-manifest: the manifest could not be made; " + options.output + " is left as it was");
-    return kExitError;
+    return kExitIoError;
   }
   if (Status committed = (*writer)->commit(); !committed.ok()) {
     console.print("vtr-manifest: cannot write " + options.output + ": " + committed.error().description());
-    return kExitError;
+    return kExitIoError;
   }
   return kExitOk;
 }

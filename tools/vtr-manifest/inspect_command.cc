@@ -83,12 +83,12 @@ int RunInspect(const InspectOptions& options, FILE* out, Console& console) {
   Result<std::string> bytes = ReadWholeFile(options.file);
   if (!bytes.ok()) {
     console.print("vtr-manifest: " + bytes.error().description());
-    return kExitError;
+    return ExitStatusOfLoad(bytes.error());
   }
   std::optional<VTRSignedManifest> manifest = VTRSignedManifest::unverifiedManifestWithBytes(std::move(*bytes));
   if (!manifest) {
     console.print("vtr-manifest: " + options.file + " is not a signed manifest this tool can read");
-    return kExitError;
+    return kExitBadInput;
   }
   const Json description = Describe(*manifest);
   if (options.json) {
@@ -96,7 +96,7 @@ int RunInspect(const InspectOptions& options, FILE* out, Console& console) {
   } else {
     PrintText(description, out);
   }
-  return std::fflush(out) == 0 ? kExitOk : kExitError;
+  return std::fflush(out) == 0 ? kExitOk : kExitIoError;
 }
 
 }  // namespace vtr::manifest_tool

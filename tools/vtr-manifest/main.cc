@@ -23,6 +23,7 @@ int main(int argc, char** argv) {
   ConsoleLogInstaller installed(console);
   switch (line->command) {
     case CommandLine::Command::kHelp: PrintUsage(stdout); return kExitOk;
+    case CommandLine::Command::kVersion: vtr::tools::PrintVersion("vtr-manifest"); return kExitOk;
     case CommandLine::Command::kCreate: return RunCreate(line->create, *console);
     case CommandLine::Command::kShow: return RunShow(line->show, stdout, *console);
     case CommandLine::Command::kCompare: return RunCompare(line->compare, stdout, *console);

@@ -58,6 +58,13 @@ Result<std::unique_ptr<ManifestSource>> ManifestSource::Load(const ManifestSelec
   if (!IsSignedManifest(top)) {
     if (selection.container) return Error::Invalid(file + " is not a signed manifest");
     if (!top.isDictionary()) return Error::Invalid(file + " does not hold a dictionary");
+    // A manifest maps paths to records; anything else is some other list.
+    for (uint64_t i = 0; i < top.count(); ++i) {
+      if (!top.valueAt(i).isDictionary() || !top.keyAt(i).starts_with('/')) {
+        return Error::Invalid(file + " is not a manifest: its entry \"" + top.keyAt(i) +
+                              "\" is not a path with its record");
+      }
+    }
     source->records_ = top;
     return source;
   }
@@ -77,6 +84,10 @@ Result<std::unique_ptr<ManifestSource>> ManifestSource::Load(const ManifestSelec
     }
   }
   return source;
+}
+
+int ExitStatusOfLoad(const Error& error) {
+  return error.code() == ENOENT || error.code() == EACCES || error.code() == ENOTDIR ? kExitNoInput : kExitBadInput;
 }
 
 }  // namespace vtr::manifest_tool

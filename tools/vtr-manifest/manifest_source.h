@@ -46,6 +46,10 @@ class ManifestSource {
 // The whole bytes of the file at path (links followed, as a tool does).
 Result<std::string> ReadWholeFile(const std::string& path);
 
+// The exit status for a failed Load: the file is missing or unreadable, or it
+// is no manifest.
+int ExitStatusOfLoad(const Error& error);
+
 }  // namespace vtr::manifest_tool
 
 #endif  // VTR_TOOLS_VTR_MANIFEST_MANIFEST_SOURCE_H_

@@ -40,19 +40,19 @@ int RunShow(const ShowOptions& options, FILE* out, Console& console) {
   Result<std::unique_ptr<ManifestSource>> source = ManifestSource::Load(options.manifest);
   if (!source.ok()) {
     console.print("vtr-manifest: " + source.error().description());
-    return kExitError;
+    return ExitStatusOfLoad(source.error());
   }
   PlistNode records = (*source)->records();
   if (options.path) {
     const PlistNode record = records.get(*options.path);
     if (record.isNil()) {
       console.print("vtr-manifest: the manifest has no entry " + *options.path);
-      return kExitFailure;
+      return kExitNo;
     }
     Result<Value> value = record.value();
     if (!value.ok()) {
       console.print("vtr-manifest: " + value.error().description());
-      return kExitError;
+      return kExitBadInput;
     }
     records = PlistNode(Value::DictionaryOf({{*options.path, *value}}));
   }
@@ -62,14 +62,14 @@ int RunShow(const ShowOptions& options, FILE* out, Console& console) {
     Result<std::string> xml = manifest.ok() ? EncodeXmlPropertyList(*manifest) : Result<std::string>(manifest.error());
     if (!xml.ok()) {
       console.print("vtr-manifest: cannot show the manifest as XML: " + xml.error().description());
-      return kExitError;
+      return kExitBadInput;
     }
     std::fputs(xml->c_str(), out);
   } else if (!PrintEntries(records, options.format, out)) {
     console.print("vtr-manifest: a record of the manifest is too large to build");
-    return kExitError;
+    return kExitBadInput;
   }
-  return std::fflush(out) == 0 ? kExitOk : kExitError;
+  return std::fflush(out) == 0 ? kExitOk : kExitIoError;
 }
 
 }  // namespace vtr::manifest_tool

@@ -2,6 +2,7 @@
 #include "platform/plist.h"
 #include "platform/signing_files.h"
 #include "tools/vtr-manifest/commands.h"
+#include "tools/vtr-manifest/manifest_source.h"
 
 namespace vtr::manifest_tool {
 namespace {
@@ -92,7 +93,7 @@ Status Sign(const SignOptions& options) {
 int RunSign(const SignOptions& options, Console& console) {
   if (Status signed_ = Sign(options); !signed_.ok()) {
     console.print("vtr-manifest: " + signed_.error().description());
-    return kExitError;
+    return ExitStatusOfLoad(signed_.error());
   }
   return kExitOk;
 }

@@ -8,7 +8,7 @@ int RunVerify(const VerifyOptions& options, FILE* out, Console& console) {
   Result<std::string> bytes = ReadWholeFile(options.file);
   if (!bytes.ok()) {
     console.print("vtr-manifest: " + bytes.error().description());
-    return kExitError;
+    return ExitStatusOfLoad(bytes.error());
   }
   // The helper's own messages reach the console through the log.
   SignedManifestFailure failure = SignedManifestFailure::kNone;
@@ -18,7 +18,7 @@ int RunVerify(const VerifyOptions& options, FILE* out, Console& console) {
     std::fprintf(out, "%s: trusted and well signed; payload version %d, %llu records in \"Backup\"\n",
                  options.file.c_str(), manifest->getVersion(),
                  static_cast<unsigned long long>(manifest->getManifest().count()));
-    return std::fflush(out) == 0 ? kExitOk : kExitError;
+    return std::fflush(out) == 0 ? kExitOk : kExitIoError;
   }
   // The cause in the tool's words too: a bad signature is only a debug
   // trace in the helper's log.

@@ -5,7 +5,6 @@
 #include <utility>
 #include <vector>
 
-#include "tools/zarnutil/json_writer.h"
 #include "tools/zarnutil/report_format.h"
 
 namespace vtr {

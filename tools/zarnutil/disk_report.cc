@@ -12,7 +12,7 @@
 #include "storage/file_system_resize.h"
 #include "storage/gpt_disk.h"
 #include "storage/mount_table.h"
-#include "tools/zarnutil/json_writer.h"
+#include "tools/zarnutil/report_format.h"
 
 namespace vtr {
 namespace {
@@ -58,60 +58,32 @@ int RunDisk(const ZarnutilInvocation& call) {
 
   std::string out;
   if (call.has("--json")) {
-    JsonWriter json;
-    json.beginObject();
-    json.key("disk");
-    json.string(call.image);
-    json.key("blockSize");
-    json.number(*blockSize);
-    json.key("blocks");
-    json.number(*blockCount);
-    json.key("zarnSignature");
-    json.boolean(*signature);
-    json.key("gptValid");
-    json.boolean(validity->valid());
-    json.key("firstUsable");
-    json.number(gpt->firstUsableLba());
-    json.key("lastUsable");
-    json.number(gpt->lastUsableLba());
-    json.key("freeBlocks");
-    json.number(freeBlocks);
-    json.key("entries");
-    json.beginArray();
+    Json entries = Json::array();
     for (uint32_t i = 0; i < count; ++i) {
-      json.beginObject();
-      json.key("index");
-      json.number(i);
-      json.key("name");
-      json.string(gpt->nameOf(i));
-      json.key("first");
-      json.number(gpt->firstLba(i));
-      json.key("last");
-      json.number(gpt->lastLba(i));
-      json.key("blocks");
-      json.number(gpt->lastLba(i) - gpt->firstLba(i) + 1);
-      json.key("uuid");
-      json.string(gpt->uuidOf(i));
-      json.key("data");
-      json.boolean(static_cast<int>(i) == data);
-      json.endObject();
+      entries.push_back({{"index", i},
+                         {"name", gpt->nameOf(i)},
+                         {"first", gpt->firstLba(i)},
+                         {"last", gpt->lastLba(i)},
+                         {"blocks", gpt->lastLba(i) - gpt->firstLba(i) + 1},
+                         {"uuid", gpt->uuidOf(i)},
+                         {"data", static_cast<int>(i) == data}});
     }
-    json.endArray();
+    Json report = {{"disk", call.image},
+                   {"blockSize", *blockSize},
+                   {"blocks", *blockCount},
+                   {"zarnSignature", *signature},
+                   {"gptValid", validity->valid()},
+                   {"firstUsable", gpt->firstUsableLba()},
+                   {"lastUsable", gpt->lastUsableLba()},
+                   {"freeBlocks", freeBlocks},
+                   {"entries", std::move(entries)}};
     if (mounted) {
-      json.key("dataFileSystem");
-      json.beginObject();
-      json.key("mountPoint");
-      json.string(mounted->mount.mountPoint);
-      json.key("source");
-      json.string(mounted->mount.source);
-      json.key("type");
-      json.string(mounted->fileSystem.type);
-      json.key("bytes");
-      json.number(mounted->fileSystem.bytes);
-      json.endObject();
+      report["dataFileSystem"] = {{"mountPoint", mounted->mount.mountPoint},
+                                  {"source", mounted->mount.source},
+                                  {"type", mounted->fileSystem.type},
+                                  {"bytes", mounted->fileSystem.bytes}};
     }
-    json.endObject();
-    out = json.text() + "\n";
+    out = JsonLine(report);
   } else {
     out +=
         Format("disk %@: %u-byte blocks, %llu blocks, Zarn signature %s, GPT %s\n", call.image, *blockSize, *blockCount,

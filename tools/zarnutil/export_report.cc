@@ -1,6 +1,5 @@
 #include "tools/zarnutil/export_report.h"
 
-#include "tools/zarnutil/json_writer.h"
 #include "tools/zarnutil/report_format.h"
 
 namespace vtr {
@@ -23,42 +22,19 @@ std::string ExportText(const ZarnUuid& mediaIdentity, const std::vector<ZarnExpo
 }
 
 std::string ExportJson(const ZarnUuid& mediaIdentity, const std::vector<ZarnExportedPartition>& partitions) {
-  JsonWriter json;
-  json.beginObject();
-  json.key("media_identity");
-  json.string(UuidText(mediaIdentity));
-  json.key("partitions");
-  json.beginArray();
+  Json listed = Json::array();
   for (const ZarnExportedPartition& p : partitions) {
-    json.beginObject();
-    json.key("index");
-    json.number(p.index);
-    json.key("name");
-    json.string(p.name);
-    json.key("type");
-    json.string(UuidText(p.type));
-    json.key("identity");
-    json.string(UuidText(p.identity));
-    json.key("size");
-    json.number(p.size);
-    json.key("flags");
-    json.number(p.flags);
-    json.key("extents");
-    json.beginArray();
-    for (const ZarnExtent& e : p.extents) {
-      json.beginObject();
-      json.key("offset");
-      json.number(e.offset);
-      json.key("length");
-      json.number(e.length);
-      json.endObject();
-    }
-    json.endArray();
-    json.endObject();
+    Json extents = Json::array();
+    for (const ZarnExtent& e : p.extents) extents.push_back({{"offset", e.offset}, {"length", e.length}});
+    listed.push_back({{"index", p.index},
+                      {"name", p.name},
+                      {"type", UuidText(p.type)},
+                      {"identity", UuidText(p.identity)},
+                      {"size", p.size},
+                      {"flags", p.flags},
+                      {"extents", std::move(extents)}});
   }
-  json.endArray();
-  json.endObject();
-  return json.text() + "\n";
+  return JsonLine({{"media_identity", UuidText(mediaIdentity)}, {"partitions", std::move(listed)}});
 }
 
 }  // namespace vtr

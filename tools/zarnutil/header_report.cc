@@ -3,7 +3,6 @@
 #include <algorithm>
 #include <cstdio>
 
-#include "tools/zarnutil/json_writer.h"
 #include "tools/zarnutil/report_format.h"
 
 namespace vtr {
@@ -64,46 +63,26 @@ std::string HeaderText(const ZarnMediaProperties& props, ZarnHeaderView header) 
 }
 
 std::string HeaderJson(ZarnHeaderView header) {
-  JsonWriter json;
-  json.beginObject();
-  json.key("media_size");
-  json.number(header.mediaSize());
-  json.key("media_identity");
-  json.string(UuidText(header.mediaIdentity()));
-  json.key("partition_count");
-  json.number(header.partitionCount());
-  json.key("crc");
-  json.number(header.crc());
-  json.key("flags");
-  json.number(header.flags());
-  json.key("partitions");
-  json.beginArray();
+  Json partitions = Json::array();
   for (uint32_t i = 0; i < ListedPartitions(header); ++i) {
     const ZarnEntryView entry = header.entry(i);
-    json.beginObject();
-    json.key("index");
-    json.number(i);
-    json.key("type");
-    json.string(UuidText(entry.type()));
-    json.key("identity");
-    json.string(UuidText(entry.identity()));
-    json.key("begin");
-    json.number(entry.begin());
-    json.key("end");
-    json.number(entry.end());
-    json.key("attributes");
-    json.number(entry.attributes());
-    json.key("name");
-    json.string(EntryName(entry));
-    json.endObject();
+    partitions.push_back({{"index", i},
+                          {"type", UuidText(entry.type())},
+                          {"identity", UuidText(entry.identity())},
+                          {"begin", entry.begin()},
+                          {"end", entry.end()},
+                          {"attributes", entry.attributes()},
+                          {"name", EntryName(entry)}});
   }
-  json.endArray();
-  json.key("chunk_map");
-  json.beginArray();
-  for (uint32_t s = 0; s < kZarnChunkMapSlots; ++s) json.number(header.chunk(s));
-  json.endArray();
-  json.endObject();
-  return json.text() + "\n";
+  Json chunks = Json::array();
+  for (uint32_t s = 0; s < kZarnChunkMapSlots; ++s) chunks.push_back(header.chunk(s));
+  return JsonLine({{"media_size", header.mediaSize()},
+                   {"media_identity", UuidText(header.mediaIdentity())},
+                   {"partition_count", header.partitionCount()},
+                   {"crc", header.crc()},
+                   {"flags", header.flags()},
+                   {"partitions", std::move(partitions)},
+                   {"chunk_map", std::move(chunks)}});
 }
 
 }  // namespace vtr

@@ -1,56 +1,73 @@
-// zarnutil: create, inspect, check, repair and export the Zarn volume-manager
-// header of a disk image or block device, and draw its chunk map.
+// zarnutil: create, inspect, check, repair and export the Zarn
+// volume-manager header of a disk image or block device.
+#include <getopt.h>
+
 #include <cstdio>
 #include <cstring>
 #include <string>
 #include <string_view>
 
+#include "tools/common/tool_conventions.h"
 #include "tools/zarnutil/commands.h"
 #include "tools/zarnutil/disk_report.h"
 
 namespace {
 
+using vtr::tools::kExitUsage;
+
 constexpr char kUsage[] =
-    "usage: zarnutil [--block-size N] COMMAND IMAGE [OPTIONS]\n"
+    "usage: zarnutil [OPTIONS] COMMAND IMAGE\n"
     "\n"
     "Works on the Zarn volume-manager header of IMAGE, a disk image file or a\n"
     "block device.\n"
     "\n"
     "commands:\n"
-    "  create IMAGE            write a fresh header (main and backup copies)\n"
-    "  show IMAGE [--json]     print the header: fields, partitions, chunk map\n"
-    "  check IMAGE             exit 0 when the header is consistent, 1 if not\n"
-    "  repair [--strict] IMAGE repair the header and write both copies;\n"
-    "                          --strict fails on a fault and writes nothing\n"
-    "  export IMAGE [--json]   print the partitions with their extents\n"
-    "  map IMAGE               draw the chunk map (32 x 32, one mark a chunk)\n"
-    "  disk DISK [--json]      the boot disk as the data-partition resize sees\n"
-    "                          it: signature, GPT copies, entries, free blocks,\n"
-    "                          the file system mounted from \"Data\"\n"
+    "  create IMAGE     write a fresh header (main and backup copies); refuses\n"
+    "                   to replace a header already there unless --force\n"
+    "  show IMAGE       print the header: fields, partitions, chunk map\n"
+    "  check IMAGE      exit 0 when the header is consistent, 1 if not\n"
+    "  repair IMAGE     repair the header and write both copies; a header that\n"
+    "                   passes the check is left alone unless --force\n"
+    "  export IMAGE     print the partitions with their extents\n"
+    "  map IMAGE        draw the chunk map (32 x 32, one mark a chunk)\n"
+    "  disk DISK        the boot disk as the data-partition resize sees it:\n"
+    "                   signature, GPT copies, entries, free blocks, the file\n"
+    "                   system mounted from \"Data\"\n"
     "\n"
     "options:\n"
-    "  --block-size N          block size of an image file (default 4096);\n"
-    "                          a block device always uses its own\n"
-    "  -h, --help              show this help\n"
+    "  --block-size N   block size of an image file (default 4096); a block\n"
+    "                   device always uses its own\n"
+    "  --json           show, check, repair, export, disk: print JSON\n"
+    "  --strict         repair: fail on the first fault and write nothing\n"
+    "  --dry-run        create, repair: say what would be written, write nothing\n"
+    "  --force          create: replace an existing header; repair: repair a\n"
+    "                   header that passes the check too\n"
+    "  -h, --help       show this help\n"
+    "  -V, --version    show the version\n"
     "\n"
-    "Exit status: 0 success, 1 failure, 2 usage error.\n";
+    "Exit status: 0 done, 1 the check found a fault (or a strict repair failed),\n"
+    "64 usage error, 65 no valid header (or one in the way of create), 66 the image\n"
+    "cannot be opened, 74 reading or writing the image failed.\n";
 
 struct Command {
   const char* name;
-  const char* flag;  // the command's own option, or nullptr
+  const char* options;  // the options it takes, as typed, space-separated
   int (*run)(const vtr::ZarnutilInvocation&);
 };
 
 constexpr Command kCommands[] = {
-    {"create", nullptr, vtr::RunCreate}, {"show", "--json", vtr::RunShow},
-    {"check", nullptr, vtr::RunCheck},   {"repair", "--strict", vtr::RunRepair},
-    {"export", "--json", vtr::RunExport}, {"map", nullptr, vtr::RunMap},
+    {"create", "--dry-run --force", vtr::RunCreate},
+    {"show", "--json", vtr::RunShow},
+    {"check", "--json", vtr::RunCheck},
+    {"repair", "--strict --dry-run --force --json", vtr::RunRepair},
+    {"export", "--json", vtr::RunExport},
+    {"map", "", vtr::RunMap},
     {"disk", "--json", vtr::RunDisk},
 };
 
 int UsageError(const std::string& problem) {
-  std::fprintf(stderr, "zarnutil: %s\n%s", problem.c_str(), kUsage);
-  return 2;
+  std::fprintf(stderr, "zarnutil: %s\nTry 'zarnutil --help'.\n", problem.c_str());
+  return kExitUsage;
 }
 
 // A block size in decimal, 1 .. kMaxImageBlockSize.
@@ -66,49 +83,55 @@ bool ParseBlockSize(std::string_view text, uint32_t* out) {
   return true;
 }
 
+bool Takes(const Command& command, const std::string& option) {
+  const std::string options = std::string(" ") + command.options + " ";
+  return options.find(" " + option + " ") != std::string::npos;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
+  enum { kBlockSize = 256, kJson, kStrict, kDryRun, kForce };
+  static const struct option kLongOptions[] = {
+      {"block-size", required_argument, nullptr, kBlockSize},
+      {"json", no_argument, nullptr, kJson},
+      {"strict", no_argument, nullptr, kStrict},
+      {"dry-run", no_argument, nullptr, kDryRun},
+      {"force", no_argument, nullptr, kForce},
+      {"help", no_argument, nullptr, 'h'},
+      {"version", no_argument, nullptr, 'V'},
+      {nullptr, 0, nullptr, 0},
+  };
   vtr::ZarnutilInvocation call;
-  int i = 1;
-  for (; i < argc && argv[i][0] == '-'; ++i) {
-    const std::string_view arg = argv[i];
-    if (arg == "-h" || arg == "--help") {
-      std::fputs(kUsage, stdout);
-      return 0;
-    }
-    std::string_view value;
-    if (arg == "--block-size") {
-      if (++i == argc) return UsageError("--block-size needs a value");
-      value = argv[i];
-    } else if (arg.starts_with("--block-size=")) {
-      value = arg.substr(std::strlen("--block-size="));
-    } else {
-      return UsageError("unknown option " + std::string(arg));
-    }
-    if (!ParseBlockSize(value, &call.imageBlockSize)) {
-      return UsageError("bad block size " + std::string(value));
+  opterr = 0;
+  int c;
+  // Options may stand anywhere: zarnutil takes no argument that starts with '-'.
+  while ((c = getopt_long(argc, argv, ":hV", kLongOptions, nullptr)) != -1) {
+    switch (c) {
+      case kBlockSize:
+        if (!ParseBlockSize(optarg, &call.imageBlockSize)) return UsageError("bad block size " + std::string(optarg));
+        break;
+      case kJson: call.flags.insert("--json"); break;
+      case kStrict: call.flags.insert("--strict"); break;
+      case kDryRun: call.flags.insert("--dry-run"); break;
+      case kForce: call.flags.insert("--force"); break;
+      case 'h': std::fputs(kUsage, stdout); return 0;
+      case 'V': vtr::tools::PrintVersion("zarnutil"); return 0;
+      case ':': return UsageError(std::string(argv[optind - 1]) + " needs a value");
+      default: return UsageError("unknown option " + std::string(argv[optind - 1]));
     }
   }
-  if (i == argc) return UsageError("no command given");
-
-  const std::string_view name = argv[i++];
+  if (optind == argc) return UsageError("no command given");
+  const std::string name = argv[optind++];
   for (const Command& command : kCommands) {
     if (name != command.name) continue;
-    for (; i < argc; ++i) {
-      const std::string_view arg = argv[i];
-      if (command.flag != nullptr && arg == command.flag) {
-        call.flags.insert(command.flag);
-      } else if (!arg.empty() && arg[0] == '-') {
-        return UsageError(std::string(name) + ": unknown option " + std::string(arg));
-      } else if (call.image.empty()) {
-        call.image = arg;
-      } else {
-        return UsageError(std::string(name) + ": more than one image given");
-      }
+    for (const std::string& flag : call.flags) {
+      if (!Takes(command, flag)) return UsageError(name + " does not take " + flag);
     }
-    if (call.image.empty()) return UsageError(std::string(name) + ": no image given");
+    if (optind == argc) return UsageError(name + ": no image given");
+    if (argc - optind > 1) return UsageError(name + ": more than one image given");
+    call.image = argv[optind];
     return command.run(call);
   }
-  return UsageError("unknown command " + std::string(name));
+  return UsageError("unknown command " + name);
 }

@@ -47,4 +47,12 @@ std::string HumanSize(uint64_t bytes) {
   return text;
 }
 
+std::string JsonLine(const Json& value) {
+  return value.dump(-1, ' ', false, Json::error_handler_t::replace) + "\n";
+}
+
+std::string JsonQuote(std::string_view text) {
+  return Json(std::string(text)).dump(-1, ' ', false, Json::error_handler_t::replace);
+}
+
 }  // namespace vtr

@@ -2,9 +2,12 @@
 #ifndef VTR_TOOLS_ZARNUTIL_REPORT_FORMAT_H_
 #define VTR_TOOLS_ZARNUTIL_REPORT_FORMAT_H_
 
+#include <nlohmann/json.hpp>
+
 #include <cstdint>
 #include <span>
 #include <string>
+#include <string_view>
 
 #include "storage/zarn_layout.h"
 
@@ -18,6 +21,17 @@ std::string EntryName(const ZarnEntryView& entry);
 
 // "0x" and value in hexadecimal, zero-padded to digits.
 std::string Hex(uint64_t value, int digits);
+
+// The reports' JSON: members in the order they are added.
+using Json = nlohmann::ordered_json;
+
+// value as one line of compact JSON and a newline; bytes that are not
+// well-formed UTF-8 become U+FFFD, so the result is always valid JSON.
+std::string JsonLine(const Json& value);
+
+// text as a quoted JSON string (quotes, backslashes and control characters
+// escaped, bad UTF-8 replaced as above): safe to print on a terminal.
+std::string JsonQuote(std::string_view text);
 
 // A byte count for people: "16 MiB", "1.5 GiB", "512 bytes".
 std::string HumanSize(uint64_t bytes);

@@ -11,6 +11,8 @@
 
 #include "platform/block_geometry.h"
 #include "storage/zarn_acquire.h"
+#include "storage/zarn_header.h"
+#include "tools/common/tool_conventions.h"
 
 namespace vtr {
 namespace {
@@ -33,7 +35,9 @@ bool WriteAt(int fd, const std::vector<uint8_t>& bytes, uint64_t offset) {
 
 }  // namespace
 
-std::optional<ZarnImage> OpenZarnImage(const std::string& path, bool writable, uint32_t imageBlockSize) {
+std::optional<ZarnImage> OpenZarnImage(const std::string& path, bool writable, uint32_t imageBlockSize,
+                                       int* exitStatus) {
+  *exitStatus = tools::kExitNoInput;
   ZarnImage image;
   image.path = path;
   image.imageBlockSize = imageBlockSize;
@@ -42,6 +46,7 @@ std::optional<ZarnImage> OpenZarnImage(const std::string& path, bool writable, u
     PrintError(path, Error::FromErrno("open"));
     return std::nullopt;
   }
+  *exitStatus = tools::kExitBadInput;
   Result<uint32_t> blockSize = BlockSizeOf(image.fd.get(), imageBlockSize);
   if (!blockSize.ok()) {
     PrintError(path, blockSize.error());
@@ -58,6 +63,12 @@ std::optional<ZarnImage> OpenZarnImage(const std::string& path, bool writable, u
 
 bool AcquireHeader(const ZarnImage& image, ZarnHeaderBuffer* header) {
   return zarnAcquireHeader(image.fd.get(), &image.props, header->data(), image.imageBlockSize) == 0;
+}
+
+bool HasHeaderCopy(const ZarnImage& image) {
+  ZarnHeaderBuffer header{};
+  if (::pread(image.fd.get(), header.data(), header.size(), 0) != static_cast<ssize_t>(header.size())) return false;
+  return zarnValidateHeader(header.data()) != -2;
 }
 
 bool WriteHeaderCopies(const ZarnImage& image, const ZarnHeaderBuffer& header) {

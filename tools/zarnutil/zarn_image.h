@@ -25,12 +25,18 @@ struct ZarnImage {
 
 // Opens path (for writing too when writable) and computes its geometry. On
 // failure prints why on standard error (the library's message when the
-// geometry is refused) and returns nothing.
-std::optional<ZarnImage> OpenZarnImage(const std::string& path, bool writable, uint32_t imageBlockSize);
+// geometry is refused), sets *exitStatus (the file cannot be opened, or it is
+// not a medium the library takes) and returns nothing.
+std::optional<ZarnImage> OpenZarnImage(const std::string& path, bool writable, uint32_t imageBlockSize,
+                                       int* exitStatus);
 
 // Reads a valid header copy (main, then backup) into header; false after the
 // library's messages.
 bool AcquireHeader(const ZarnImage& image, ZarnHeaderBuffer* header);
+
+// Whether the main copy's place holds a Zarn header of a known type, valid
+// or with a wrong CRC (no messages: create asks before it overwrites).
+bool HasHeaderCopy(const ZarnImage& image);
 
 // Writes header, padded to a block with zeros, as the main copy at byte 0 and
 // the backup copy in the last block of chunk 0, and syncs the medium. False
