@@ -302,6 +302,13 @@ size_t vitd_value_count(const vitd_value* value) {
   return 0;
 }
 
+const char* vitd_dictionary_key(const vitd_value* value, size_t index) {
+  if (value == nullptr) return nullptr;
+  const vtr::XpcDictionary* dict = value->entries ? &*value->entries : value->object.dictionary();
+  if (dict == nullptr || index >= dict->size()) return nullptr;
+  return (dict->begin() + static_cast<std::ptrdiff_t>(index))->first.c_str();
+}
+
 char* vitd_value_to_json(const vitd_value* value) {
   if (value == nullptr) return nullptr;
   return Guarded(

@@ -106,6 +106,11 @@ vitd_type vitd_value_type(const vitd_value *value);
 /* Number of items of an array or entries of a dictionary; 0 otherwise. */
 size_t vitd_value_count(const vitd_value *value);
 
+/* The key of entry index of a dictionary, in the order the entries were
+ * added (for a received message: the order on the wire); NULL when value is
+ * no dictionary or index is past its end. Valid while value lives unchanged. */
+const char *vitd_dictionary_key(const vitd_value *value, size_t index);
+
 /* The value as one line of JSON: data and UUIDs in base64, dates as
  * nanoseconds since 1970, bytes that are not UTF-8 replaced by U+FFFD.
  * Release with free(); NULL when memory runs out. */

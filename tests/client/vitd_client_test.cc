@@ -210,9 +210,12 @@ TEST(VitdClientValues, BuildParseAndPrint) {
   ASSERT_EQ(vitd_dictionary_set(dict, "k2", vitd_null()), VITD_OK);  // replaces
   EXPECT_EQ(vitd_value_type(dict), VITD_TYPE_DICTIONARY);
   EXPECT_EQ(vitd_value_count(dict), 2u);
+  EXPECT_STREQ(vitd_dictionary_key(dict, 1), "k2");
+  EXPECT_EQ(vitd_dictionary_key(dict, 2), nullptr);
   EXPECT_EQ(JsonText(dict).str(), R"({"k":["/wA=",-1,7,0.25],"k2":null})");
   vitd_value_free(dict);
   vitd_value* invalid = vitd_string("a\xff");
+  EXPECT_EQ(vitd_dictionary_key(invalid, 0), nullptr);
   EXPECT_EQ(JsonText(invalid).str(), "\"a\xef\xbf\xbd\"");
   vitd_value_free(invalid);
 }

@@ -283,6 +283,14 @@ class ShowAndCompareTest(unittest.TestCase):
             "4 owner-or-mode-differs /dir/empty",
             "5 xattrs-differ /dir/sub",
         ]))
+        # The same as one JSON document.
+        result = run("compare", self.out, self.root, "--json")
+        self.assertEqual(result.returncode, 1)
+        document = json.loads(result.stdout)
+        self.assertFalse(document["matches"])
+        self.assertIn({"code": None, "name": "not-in-manifest", "path": "/new"}, document["differences"])
+        self.assertIn({"code": 2, "name": "content-differs", "path": "/dir/small"}, document["differences"])
+        self.assertEqual(len(document["differences"]), 7)
 
     def test_usage_errors(self):
         for args in ([], ["frobnicate"], ["create", self.root], ["show"], ["show", self.out, "--format", "yaml"],
@@ -335,9 +343,9 @@ class SignedManifestTest(unittest.TestCase):
         self.assertEqual(result.returncode, 0, result.stderr)
         return out
 
-    def verify(self, path, anchors=None):
+    def verify(self, path, anchors=None, *options):
         return run("verify", path, "--anchors", anchors or self.anchors, "--test-anchors",
-                   os.path.join(self.tmp, "none"), "--efivars", self.efivars)
+                   os.path.join(self.tmp, "none"), "--efivars", self.efivars, *options)
 
     def rewritten(self, path, name, change):
         """A copy of the signed manifest at path with change applied to its
@@ -374,6 +382,8 @@ class SignedManifestTest(unittest.TestCase):
                 self.assertEqual(result.returncode, 0, result.stderr)
                 self.assertIn(f"{len(records)} records", result.stdout.decode())
                 self.assertIn("Manifest passed signature check.", result.stderr.decode())
+                verdict = json.loads(self.verify(signed, None, "--json").stdout)
+                self.assertEqual((verdict["trusted"], verdict["cause"], verdict["records"]), (True, None, len(records)))
                 # The signed manifest shows and compares as the manifest it holds.
                 self.assertEqual(run("show", signed).stdout, run("show", self.manifest).stdout)
                 self.assertEqual(run("compare", signed, self.root).returncode, 0)
@@ -405,6 +415,10 @@ class SignedManifestTest(unittest.TestCase):
                 result = self.verify(path, anchors)
                 self.assertEqual(result.returncode, status, result.stderr)
                 self.assertIn(message, result.stderr.decode())
+                if status in (3, 4, 5, 6):  # a verdict, also as JSON
+                    verdict = json.loads(self.verify(path, anchors, "--json").stdout)
+                    self.assertEqual((verdict["file"], verdict["trusted"]), (path, False))
+                    self.assertTrue(verdict["cause"])
 
     def test_inspect_shows_the_outer_fields_and_the_payload(self):
         signed = self.sign("inspect.plist", "--app-data", f"com.example.app={self.manifest}", "--info", "shown")

@@ -163,9 +163,9 @@ TEST_F(ServiceTest, TheExampleClientAndVitdctlDriveTheHelperThroughTheClientLibr
   // vitdctl says why the second never comes.
   TempDir dir;
   WriteFile(dir / "request.json", R"({"prepareWorkContainer:": "/private/var/F", "zzz:": true})");
-  HelperSandbox::RunResult partial = vitdctl(VitdctlExecutable(), {"send", dir / "request.json"});
+  HelperSandbox::RunResult partial = vitdctl(VitdctlExecutable(), {"--label", "send", dir / "request.json"});
   EXPECT_EQ(partial.status, 75);
-  EXPECT_EQ(partial.output, "{\"Response\":true}\n");
+  EXPECT_EQ(partial.output, "prepareWorkContainer: {\"Response\":true}\n");
   EXPECT_NE(partial.errors.find("after 1 of 2 responses"), std::string::npos) << partial.errors;
   EXPECT_NE(partial.errors.find("a request key it does not know"), std::string::npos) << partial.errors;
 }

@@ -20,7 +20,7 @@ constexpr char kDefaultSocket[] = VITD_HELPER_SOCKET;
 
 void PrintUsage(FILE* out) {
   std::fprintf(out,
-               "Usage: vitdctl [--root DIR | --socket PATH] [--timeout S] COMMAND [ARGS...]\n"
+               "Usage: vitdctl [--root DIR | --socket PATH] [--timeout S] [--label] COMMAND [ARGS...]\n"
                "\n"
                "Sends a request to the demo-mode helper and prints each message it sends\n"
                "back as one line of JSON ({\"Response\":true}, {\"Progress\":42}, {\"Data\":\"...\"}).\n"
@@ -45,6 +45,7 @@ void PrintUsage(FILE* out) {
                "  --root DIR     talk to a helper running with --root DIR\n"
                "  --socket PATH  the helper's socket (default %s)\n"
                "  --timeout S    seconds to wait for the next message (default 60)\n"
+               "  --label        start each line with the command it answers\n"
                "  -h, --help     show this text\n"
                "  -V, --version  show the version\n"
                "\n"
@@ -68,7 +69,8 @@ int main(int argc, char** argv) {
   static const struct option kLongOptions[] = {
       {"root", required_argument, nullptr, 'r'},     {"socket", required_argument, nullptr, 's'},
       {"timeout", required_argument, nullptr, 't'},  {"help", no_argument, nullptr, 'h'},
-      {"version", no_argument, nullptr, 'V'},        {nullptr, 0, nullptr, 0},
+      {"version", no_argument, nullptr, 'V'},        {"label", no_argument, nullptr, 'l'},
+      {nullptr, 0, nullptr, 0},
   };
   SessionOptions options;
   options.socketPath = kDefaultSocket;
@@ -91,6 +93,7 @@ int main(int argc, char** argv) {
       }
       case 'h': PrintUsage(stdout); return 0;
       case 'V': PrintVersion("vitdctl"); return 0;
+      case 'l': options.label = true; break;
       case ':': UsageError(std::string(argv[optind - 1]) + " needs a value");
       default: UsageError("unknown option " + std::string(argv[optind - 1]));
     }

@@ -43,6 +43,7 @@ void ExplainSilence(size_t responses) {
 
 struct Progress {
   const SessionOptions* options;
+  const vitd_value* request;
   FILE* out;
   size_t responses = 0;
   bool allTrue = true;
@@ -61,6 +62,12 @@ int PrintMessage(const vitd_message* message, void* context) {
     state->barShown = false;
   }
   char* json = vitd_value_to_json(message->object);
+  if (state->options->label) {
+    // The key without its colon: the command as typed.
+    const char* key = vitd_dictionary_key(state->request, state->responses);
+    const std::string command = key != nullptr ? std::string(key).substr(0, std::string(key).find(':')) : "?";
+    std::fprintf(state->out, "%s: ", command.c_str());
+  }
   std::fprintf(state->out, "%s\n", json != nullptr ? json : "{}");
   std::free(json);
   std::fflush(state->out);
@@ -87,7 +94,7 @@ int RunSession(const SessionOptions& options, const vitd_value& request, FILE* o
   }
 
   const size_t expected = vitd_value_count(&request);
-  Progress state{&options, out};
+  Progress state{&options, &request, out};
   while (state.responses < expected) {
     const int status = vitd_receive(client, PrintMessage, &state);
     if (status == VITD_OK) continue;

@@ -27,6 +27,9 @@ struct SessionOptions {
   // The request ends the helper: the connection closing before a reply is
   // its success (a reply still counts as the helper gives it).
   bool closeIsSuccess = false;
+  // Start each line with the command it answers ("prepareWorkContainer: "):
+  // the helper answers a request's keys in their order, one "Response" each.
+  bool label = false;
 };
 
 // Sends request (a dictionary) and prints each message received as one line

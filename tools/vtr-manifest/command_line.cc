@@ -1,6 +1,9 @@
 #include "tools/vtr-manifest/command_line.h"
 
+#include <getopt.h>
+
 #include <charconv>
+#include <iterator>
 
 namespace vtr::manifest_tool {
 namespace {
@@ -102,8 +105,12 @@ const Option kOptions[] = {
      [](CommandLine& c, const std::string& v) { c.verify.anchors.test = v; return Status::Ok(); }},
     {"--efivars", true, kVerifying,
      [](CommandLine& c, const std::string& v) { c.verify.anchors.efiVariables = v; return Status::Ok(); }},
-    {"--json", false, Bit(Command::kInspect),
-     [](CommandLine& c, const std::string&) { c.inspect.json = true; return Status::Ok(); }},
+    {"--json", false, Bit(Command::kInspect) | Bit(Command::kCompare) | kVerifying,
+     [](CommandLine& c, const std::string&) {
+       (c.command == Command::kInspect ? c.inspect.json : c.command == Command::kCompare ? c.compare.json
+                                                                                         : c.verify.json) = true;
+       return Status::Ok();
+     }},
     {"--format", true, Bit(Command::kShow),
      [](CommandLine& c, const std::string& v) { return ParseFormat(v, &c.show.format); }},
     {"--path", true, Bit(Command::kShow),
@@ -119,17 +126,6 @@ const struct {
   size_t operands;  // FILE and/or DIR
 } kCommands[] = {{"create", Command::kCreate, 1}, {"show", Command::kShow, 1},     {"compare", Command::kCompare, 2},
                  {"sign", Command::kSign, 1},     {"verify", Command::kVerify, 1}, {"inspect", Command::kInspect, 1}};
-
-// The option arg names ("--name" or "--name=value"), or null.
-const Option* FindOption(const std::string& arg) {
-  for (const Option& option : kOptions) {
-    const size_t n = std::char_traits<char>::length(option.name);
-    if (arg.compare(0, n, option.name) == 0 && (arg.size() == n || (option.takesValue && arg[n] == '='))) {
-      return &option;
-    }
-  }
-  return nullptr;
-}
 
 Status SetOperands(CommandLine& c, const std::vector<std::string>& operands) {
   switch (c.command) {
@@ -178,40 +174,55 @@ Result<CommandLine> ParseCommandLine(const std::vector<std::string>& arguments) 
   }
   if (!known) return Error::Invalid("unknown command '" + word + "'");
 
-  std::vector<std::string> operands;
-  bool optionsEnded = false;
-  for (size_t i = 1; i < arguments.size(); ++i) {
-    const std::string& arg = arguments[i];
-    if (optionsEnded || arg.size() < 2 || arg[0] != '-') {
-      operands.push_back(arg);
+  // getopt_long over the command's arguments, as the other tools parse
+  // theirs: options anywhere, "--" ends them. Each option's index in kOptions
+  // is its value; "-o" is the one short option.
+  std::vector<struct option> longOptions;
+  std::string shortOptions = ":h";
+  for (size_t i = 0; i < std::size(kOptions); ++i) {
+    const char* name = kOptions[i].name;
+    if (name[1] != '-') {
+      shortOptions += name[1];
+      if (kOptions[i].takesValue) shortOptions += ':';
       continue;
     }
-    if (arg == "--") {
-      optionsEnded = true;
-      continue;
-    }
-    if (arg == "--help" || arg == "-h") {
+    longOptions.push_back({name + 2, kOptions[i].takesValue ? required_argument : no_argument, nullptr,
+                           static_cast<int>(256 + i)});
+  }
+  longOptions.push_back({"help", no_argument, nullptr, 'h'});
+  longOptions.push_back({nullptr, 0, nullptr, 0});
+  std::vector<std::string> words = arguments;
+  std::vector<char*> argv;
+  for (std::string& w : words) argv.push_back(w.data());
+  argv.push_back(nullptr);
+
+  optind = 0;  // a fresh scan (GNU getopt)
+  opterr = 0;
+  int code;
+  while ((code = getopt_long(static_cast<int>(words.size()), argv.data(), shortOptions.c_str(), longOptions.data(),
+                             nullptr)) != -1) {
+    if (code == 'h') {
       c.command = Command::kHelp;
       return c;
     }
-    const Option* option = FindOption(arg);
-    if (option == nullptr) return Error::Invalid("unknown option '" + arg + "'");
+    const std::string given = argv[optind - 1] != nullptr ? argv[optind - 1] : "";
+    if (code == ':') return Error::Invalid(given + " needs a value");
+    const Option* option = nullptr;
+    if (code >= 256) {
+      option = &kOptions[code - 256];
+    } else {
+      for (const Option& candidate : kOptions) {
+        if (candidate.name[1] == code) option = &candidate;
+      }
+    }
+    if (option == nullptr) return Error::Invalid("unknown option '" + given + "'");
     if ((option->commands & Bit(c.command)) == 0) {
       return Error::Invalid(std::string(option->name) + " is not an option of " + word);
     }
-    std::string value;
-    if (option->takesValue) {
-      const size_t n = std::char_traits<char>::length(option->name);
-      if (arg.size() > n) {
-        value = arg.substr(n + 1);
-      } else if (i + 1 < arguments.size()) {
-        value = arguments[++i];
-      } else {
-        return Error::Invalid(std::string(option->name) + " needs a value");
-      }
-    }
-    if (Status applied = option->apply(c, value); !applied.ok()) return applied.error();
+    if (Status applied = option->apply(c, optarg != nullptr ? optarg : ""); !applied.ok()) return applied.error();
   }
+  // getopt permuted argv (not words): the operands are at its end.
+  const std::vector<std::string> operands(argv.begin() + optind, argv.end() - 1);
   if (operands.size() != operandCount) {
     return Error::Invalid(word + (operandCount == 1 ? " takes one operand" : " takes two operands"));
   }
@@ -225,11 +236,11 @@ void PrintUsage(FILE* out) {
       "  vtr-manifest create DIR [--relative-to R] [--inclusive] [--skip PATH]... [--jobs N] -o FILE\n"
       "  vtr-manifest show FILE [--format text|json|xml] [--path KEY] [--container ID]\n"
       "  vtr-manifest compare FILE DIR [--relative-to R] [--inclusive] [--skip PATH]... [--jobs N]\n"
-      "                       [--container ID]\n"
+      "                       [--container ID] [--json]\n"
       "  vtr-manifest sign MANIFEST --key KEY --certificate CERT... -o FILE [--app-data ID=MANIFEST]...\n"
       "                    [--group-data ID=MANIFEST]... [--extension-data ID=MANIFEST]...\n"
       "                    [--payload-version 3|4] [--info TEXT] [--xml]\n"
-      "  vtr-manifest verify FILE [--anchors DIR] [--test-anchors DIR] [--efivars DIR]\n"
+      "  vtr-manifest verify FILE [--anchors DIR] [--test-anchors DIR] [--efivars DIR] [--json]\n"
       "  vtr-manifest inspect FILE [--json]\n"
       "\n"
       "create   writes the manifest of the tree DIR (each item's attributes, extended\n"
@@ -243,7 +254,9 @@ void PrintUsage(FILE* out) {
       "compare  walks DIR as create does and prints every difference from the\n"
       "         manifest FILE as \"CODE NAME PATH\": 1 type-differs, 2 content-differs,\n"
       "         3 link-target-differs, 4 owner-or-mode-differs, 5 xattrs-differ,\n"
-      "         0 missing-on-disk, and \"- not-in-manifest\" for items FILE lacks.\n"
+      "         0 missing-on-disk, and \"- not-in-manifest\" for items FILE lacks;\n"
+      "         --json prints {\"matches\": ..., \"differences\": [{\"code\", \"name\",\n"
+      "         \"path\"}]} (code null for not-in-manifest).\n"
       "sign     writes a signed manifest: a payload holding MANIFEST as the whole-device\n"
       "         manifest (\"Backup\") and each --app-data/--group-data/--extension-data\n"
       "         manifest under its identifier, signed (RSA, PKCS#1 v1.5, SHA-1) with the\n"
@@ -254,6 +267,8 @@ void PrintUsage(FILE* out) {
       "         /usr/share/vitd/anchors/production), or on a device whose Secure Boot\n"
       "         variable in --efivars says it is not fused, --test-anchors (default\n"
       "         /usr/share/vitd/anchors/test); then the signature of the payload.\n"
+      "         --json prints {\"file\", \"trusted\", \"cause\", \"payloadVersion\",\n"
+      "         \"records\"}.\n"
       "inspect  prints a signed manifest's version, certificates (subject, issuer,\n"
       "         validity), signature size and a summary of its payload; no check.\n"
       "\n"

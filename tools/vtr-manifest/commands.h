@@ -58,6 +58,7 @@ struct ShowOptions {
 struct CompareOptions {
   ManifestSelection manifest;
   WalkOptions walk;
+  bool json = false;  // one JSON document instead of a line per difference
 };
 
 // A signed manifest made of manifests: the payload holds the whole-device
@@ -78,6 +79,7 @@ struct SignOptions {
 struct VerifyOptions {
   std::string file;
   SigningAnchors anchors;
+  bool json = false;  // the verdict as a JSON document
 };
 
 struct InspectOptions {

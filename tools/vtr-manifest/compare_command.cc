@@ -1,6 +1,10 @@
 // vtr-manifest compare: a tree checked against a manifest, item by item.
+#include <nlohmann/json.hpp>
+
 #include <algorithm>
 #include <functional>
+#include <optional>
+#include <string>
 #include <vector>
 
 #include "model/file_metadata.h"
@@ -63,22 +67,29 @@ int RunCompare(const CompareOptions& options, FILE* out, Console& console) {
   EntryIndex index(expected);
   bool differs = false;
   bool built = true;
+  nlohmann::json differences = nlohmann::json::array();
+  // One difference: a line now, or an entry of the JSON document at the end.
+  auto report = [&](std::optional<int> code, const char* name, const std::string& key) {
+    differs = true;
+    if (options.json) {
+      differences.push_back({{"code", code ? nlohmann::json(*code) : nlohmann::json(nullptr)}, {"name", name},
+                             {"path", key}});
+    } else {
+      std::fprintf(out, "%s %s %s\n", code ? std::to_string(*code).c_str() : "-", name, EscapedText(key).c_str());
+    }
+  };
   const bool filled = RunWalk(
       options.walk,
       [&](const VTRFileMetadata& onDisk, const std::string& key) {
         const std::optional<uint64_t> entry = index.meet(key);
         if (!entry) {
-          std::fprintf(out, "- not-in-manifest %s\n", EscapedText(key).c_str());
-          differs = true;
+          report(std::nullopt, "not-in-manifest", key);
           return true;
         }
         Result<Value> record = expected.valueAt(*entry).value();
         if (!record.ok()) return built = false;
         const int code = VTRFileMetadata(*record).compareWith(&onDisk);
-        if (code != kVTRFileSame) {
-          std::fprintf(out, "%d %s %s\n", code, kDifferenceNames[code], EscapedText(key).c_str());
-          differs = true;
-        }
+        if (code != kVTRFileSame) report(code, kDifferenceNames[code], key);
         return true;
       },
       console);
@@ -88,9 +99,11 @@ int RunCompare(const CompareOptions& options, FILE* out, Console& console) {
   }
   for (uint64_t i = 0; i < expected.count(); ++i) {
     if (index.met(i)) continue;
-    std::fprintf(out, "%d %s %s\n", kVTRFileOtherAbsent, kDifferenceNames[kVTRFileOtherAbsent],
-                 EscapedText(expected.keyAt(i)).c_str());
-    differs = true;
+    report(kVTRFileOtherAbsent, kDifferenceNames[kVTRFileOtherAbsent], expected.keyAt(i));
+  }
+  if (options.json) {
+    const nlohmann::json document = {{"matches", !differs}, {"differences", std::move(differences)}};
+    std::fprintf(out, "%s\n", document.dump(-1, ' ', false, nlohmann::json::error_handler_t::replace).c_str());
   }
   if (std::fflush(out) != 0) return kExitIoError;
   if (!filled) {

@@ -1,4 +1,6 @@
 // vtr-manifest verify: a signed manifest checked as the helper checks it.
+#include <nlohmann/json.hpp>
+
 #include "tools/vtr-manifest/commands.h"
 #include "tools/vtr-manifest/manifest_source.h"
 
@@ -14,10 +16,25 @@ int RunVerify(const VerifyOptions& options, FILE* out, Console& console) {
   SignedManifestFailure failure = SignedManifestFailure::kNone;
   std::optional<VTRSignedManifest> manifest =
       VTRSignedManifest::signedManifestWithBytes(std::move(*bytes), options.anchors, &failure);
+  // The verdict as JSON, for scripts: trusted or the cause.
+  auto printJson = [&](const char* cause) {
+    nlohmann::json verdict = {{"file", options.file}, {"trusted", manifest.has_value()}, {"cause", nullptr}};
+    if (manifest) {
+      verdict["payloadVersion"] = manifest->getVersion();
+      verdict["records"] = manifest->getManifest().count();
+    } else {
+      verdict["cause"] = cause;
+    }
+    std::fprintf(out, "%s\n", verdict.dump(-1, ' ', false, nlohmann::json::error_handler_t::replace).c_str());
+  };
   if (manifest) {
-    std::fprintf(out, "%s: trusted and well signed; payload version %d, %llu records in \"Backup\"\n",
-                 options.file.c_str(), manifest->getVersion(),
-                 static_cast<unsigned long long>(manifest->getManifest().count()));
+    if (options.json) {
+      printJson(nullptr);
+    } else {
+      std::fprintf(out, "%s: trusted and well signed; payload version %d, %llu records in \"Backup\"\n",
+                   options.file.c_str(), manifest->getVersion(),
+                   static_cast<unsigned long long>(manifest->getManifest().count()));
+    }
     return std::fflush(out) == 0 ? kExitOk : kExitIoError;
   }
   // The cause in the tool's words too: a bad signature is only a debug
@@ -34,10 +51,12 @@ int RunVerify(const VerifyOptions& options, FILE* out, Console& console) {
   for (const auto& cause : kCauses) {
     if (cause.failure == failure) {
       console.print("vtr-manifest: " + options.file + " is not trusted: " + cause.why);
+      if (options.json) printJson(cause.why);
       return cause.status;
     }
   }
   console.print("vtr-manifest: " + options.file + " is not a well-formed signed manifest");
+  if (options.json) printJson("it is not a well-formed signed manifest");
   return kExitMalformed;
 }
 
