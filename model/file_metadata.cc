@@ -19,13 +19,6 @@ namespace {
 // What a record reads of an item, by the type its attributes give.
 enum class ItemKind { kRegular, kDirectory, kSymbolicLink, kOther };
 
-ItemKind KindOfMode(mode_t mode) {
-  if (S_ISREG(mode)) return ItemKind::kRegular;
-  if (S_ISDIR(mode)) return ItemKind::kDirectory;
-  if (S_ISLNK(mode)) return ItemKind::kSymbolicLink;
-  return ItemKind::kOther;
-}
-
 ItemKind KindOfType(const Value& type) {
   const std::string* name = type.string();
   if (name == nullptr) return ItemKind::kOther;
@@ -185,57 +178,6 @@ Value HashOfItem(ItemKind kind, const OpenedItem& item, const std::string& path)
 }
 
 }  // namespace
-
-Value VTRFileMetadata::fileHashWithPath(const std::string& path) {
-  Result<ParentAndName> item = OpenItemDirectory(path);
-  struct stat st;
-  if (!item.ok() || ::fstatat(item->parent.get(), item->name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) {
-    VTRLogError("File does not exist at %@", path);
-    return Value();
-  }
-  const ItemKind kind = KindOfMode(st.st_mode);
-  return HashOfItem(kind, OpenForRecord(item->parent.get(), item->name, kind), path);
-}
-
-Value VTRFileMetadata::fileAttributesWithPath(const std::string& path) {
-  Result<ParentAndName> item = OpenItemDirectory(path);
-  if (!item.ok()) return FileAttributes(item.error(), path);
-  return FileAttributes(AttributesOfItemAt(item->parent.get(), item->name, path), path);
-}
-
-std::optional<std::vector<std::string>> VTRFileMetadata::extendedAttributeKeysWithPath(const std::string& path) {
-  Result<ParentAndName> item = OpenItemDirectory(path);
-  if (!item.ok()) {
-    VTRLogError("Could not extract extended attributes from %@.", path);
-    return std::nullopt;
-  }
-  return ExtendedAttributeKeys(XattrSource{-1, item->parent.get(), item->name, path, true});
-}
-
-Value VTRFileMetadata::valueForExtendedAttributesKey(const std::string& key, const std::string& path) {
-  Result<ParentAndName> item = OpenItemDirectory(path);
-  if (!item.ok()) {
-    VTRLogError("Could not extract extended file attributes from %@, returned %d", path, -1);
-    return Value();
-  }
-  return ExtendedAttributeValue(key, XattrSource{-1, item->parent.get(), item->name, path, true});
-}
-
-Value VTRFileMetadata::extendedAttributesWithPath(const std::string& path) {
-  Result<ParentAndName> item = OpenItemDirectory(path);
-  if (!item.ok()) {
-    VTRLogError("Could not extract extended attributes from %@.", path);
-    VTRLogError("Could not get attribute keys from file %@", path);
-    return Value();
-  }
-  return ExtendedAttributes(XattrSource{-1, item->parent.get(), item->name, path, true});
-}
-
-Value VTRFileMetadata::targetFileWithPath(const std::string& path) {
-  Result<ParentAndName> item = OpenItemDirectory(path);
-  if (!item.ok()) return TargetFile(item.error(), path);
-  return TargetFile(DestinationOfSymbolicLinkAt(item->parent.get(), item->name, path), path);
-}
 
 std::optional<VTRFileMetadata> VTRFileMetadata::initWithPath(const std::string& path) {
   Result<ParentAndName> item = OpenItemDirectory(path);

@@ -67,41 +67,6 @@ enum VTRFileComparison : int {
 
 class VTRFileMetadata {
  public:
-  // ---- Reading an item (class operations) ----
-
-  // The content hash of path for a record: nil with "File does not exist at
-  // %@" when nothing is there; empty data for a directory; otherwise the
-  // file's SHA-1, or empty data after "Maybe it's an Nimbrel file (%@)?" when
-  // it cannot be read (a symbolic link is not followed and counts as such).
-  static Value fileHashWithPath(const std::string& path);
-
-  // The item's attribute dictionary (a symbolic link is described itself),
-  // or nil after "Get file attributes failed for %@ with error - %@".
-  static Value fileAttributesWithPath(const std::string& path);
-
-  // The names of the item's extended attributes in the order the file system
-  // lists them (possibly none), or nullopt after "Could not extract extended
-  // attributes from %@." (the list size cannot be had) or "... File is
-  // expected to have extended attributes." (the list cannot be read). A
-  // symbolic link's own attributes are listed.
-  static std::optional<std::vector<std::string>> extendedAttributeKeysWithPath(const std::string& path);
-
-  // The value of one extended attribute of the item itself, as data; nil
-  // after "Could not extract extended file attributes from %@, returned %d"
-  // when it is not there (any more). If only the second read fails, "Coud not
-  // extract extended file attributes from %@. File is expected to have
-  // extended attributes." is logged and zero bytes of the first size returned.
-  static Value valueForExtendedAttributesKey(const std::string& key, const std::string& path);
-
-  // Every extended attribute of the item, name to data (an empty dictionary
-  // for none), or nil after "Could not get attribute keys from file %@". A
-  // name that disappears between listing and reading is left out.
-  static Value extendedAttributesWithPath(const std::string& path);
-
-  // The target text of the symbolic link at path, or nil after "Could not get
-  // destination of symbolic link %@ with error - %@".
-  static Value targetFileWithPath(const std::string& path);
-
   // ---- Making records ----
 
   // The record of the item at path, read from disk: nullopt after "Cannot

@@ -13,6 +13,7 @@
 #include "platform/file_dates.h"
 #include "platform/file_tree.h"
 #include "platform/open_beneath.h"
+#include "platform/paths.h"
 #include "platform/remove_item.h"
 
 namespace vtr {
@@ -160,11 +161,11 @@ bool VTRLogModel::openDayFile(int folder, const std::string& name, const std::st
 
 bool VTRLogModel::enableLogToFile(const std::string& path) {
   const std::string expanded = ExpandTilde(path);
-  const size_t slash = expanded.rfind('/');
-  if (slash == std::string::npos) return false;
-  UniqueFd folder = openLogFolder(slash == 0 ? "/" : expanded.substr(0, slash));
+  if (expanded.find('/') == std::string::npos) return false;
+  const PathParts parts = SplitLastComponent(expanded);
+  UniqueFd folder = openLogFolder(parts.parent);
   if (!folder) return false;
-  return openDayFile(folder.get(), expanded.substr(slash + 1), expanded);
+  return openDayFile(folder.get(), parts.name, expanded);
 }
 
 bool VTRLogModel::logToFileEnabled() const {

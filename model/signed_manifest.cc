@@ -232,4 +232,16 @@ bool VTRSignedManifest::verifySignature(const Value& signature, std::span<const 
   return verified;
 }
 
+PlistNode VTRSignedManifest::containerManifest(const std::string& type, const std::string& identifier) const {
+  if (type == "AppData") return getAppDataList().get(identifier).get("Manifest");
+  if (type == "GroupData") return getGroupDataList().get(identifier);
+  if (type == "ExtensionData") return getPlugInDataList().get(identifier);
+  return PlistNode();
+}
+
+bool VTRSignedManifest::LooksSigned(const PlistNode& top) {
+  return top.isDictionary() && top.get("Payload").data().has_value() &&
+         (!top.get("Certificate").isNil() || !top.get("Signature").isNil());
+}
+
 }  // namespace vtr

@@ -92,6 +92,13 @@ class VTRSignedManifest {
   PlistNode getAppDataList() const { return payload().get("AppData"); }
   PlistNode getGroupDataList() const { return payload().get("GroupData"); }
   PlistNode getPlugInDataList() const { return payload().get("ExtensionData"); }
+  // The file manifest of container identifier of type "AppData" (under its
+  // "Manifest"), "GroupData" or "ExtensionData"; nil when the type is none
+  // of these or the payload holds no such manifest.
+  PlistNode containerManifest(const std::string& type, const std::string& identifier) const;
+  // Whether top has a signed manifest's outer form: payload data and a
+  // certificate or signature beside it (nothing is checked).
+  static bool LooksSigned(const PlistNode& top);
 
   // The outer layer, for tools that show it: its version as read, the
   // certificates (DER data, leaf first), the payload's size and format.

@@ -10,6 +10,7 @@
 #include <cstring>
 #include <memory>
 
+#include "platform/directory_listing.h"
 #include "platform/format.h"
 #include "platform/paths.h"
 #include "platform/utf8.h"
@@ -18,17 +19,12 @@ namespace vtr {
 namespace {
 
 constexpr int kDirectoryOpenFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
-constexpr size_t kListingBufferBytes = 64 * 1024;
 
 TreeWalker::ItemType TypeFromMode(mode_t mode) {
   if (S_ISREG(mode)) return TreeWalker::ItemType::kRegular;
   if (S_ISDIR(mode)) return TreeWalker::ItemType::kDirectory;
   if (S_ISLNK(mode)) return TreeWalker::ItemType::kSymbolicLink;
   return TreeWalker::ItemType::kOther;
-}
-
-bool IsDotOrDotDot(const char* name) {
-  return name[0] == '.' && (name[1] == '\0' || (name[1] == '.' && name[2] == '\0'));
 }
 
 }  // namespace
@@ -67,7 +63,7 @@ void TreeWalker::enter(int parentFd, const std::string& name, const std::string&
     onError_(path, Error::FromErrno(path));
     return;
   }
-  Result<std::vector<Entry>> entries = ReadEntries(fd.get(), path);
+  Result<std::vector<DirectoryEntry>> entries = ReadDirectory(fd.get(), path);
   if (!entries.ok()) {
     onError_(path, entries.error());
     return;
@@ -75,37 +71,8 @@ void TreeWalker::enter(int parentFd, const std::string& name, const std::string&
   levels_.push_back(Level{std::make_shared<const UniqueFd>(std::move(fd)), path, std::move(*entries), 0});
 }
 
-Result<std::vector<TreeWalker::Entry>> TreeWalker::ReadEntries(int fd, const std::string& path) {
-  std::vector<Entry> entries;
-  std::unique_ptr<char[]> buffer(new char[kListingBufferBytes]);
-  for (;;) {
-    const ssize_t n = ::getdents64(fd, buffer.get(), kListingBufferBytes);
-    if (n < 0 && errno == EINTR) continue;
-    if (n < 0) return Error::FromErrno(path);
-    if (n == 0) break;
-    // The kernel fills whole records; each one's length is still checked
-    // against what it returned before the record is read.
-    for (ssize_t offset = 0; offset < n;) {
-      const auto* record = reinterpret_cast<const struct dirent64*>(buffer.get() + offset);
-      const size_t headerBytes = offsetof(struct dirent64, d_name);
-      if (static_cast<size_t>(n - offset) < headerBytes || record->d_reclen < headerBytes ||
-          record->d_reclen > n - offset) {
-        return Error(EIO, path);
-      }
-      const size_t nameBytes = ::strnlen(record->d_name, record->d_reclen - headerBytes);
-      if (nameBytes == record->d_reclen - headerBytes) return Error(EIO, path);  // no terminator
-      if (!IsDotOrDotDot(record->d_name)) {
-        entries.push_back(Entry{std::string(record->d_name, nameBytes), record->d_type});
-      }
-      offset += record->d_reclen;
-    }
-  }
-  std::sort(entries.begin(), entries.end(), [](const Entry& a, const Entry& b) { return a.name < b.name; });
-  return entries;
-}
-
 bool TreeWalker::typeOf(const Level& level, const Entry& entry, ItemType* type) {
-  switch (entry.dtype) {
+  switch (entry.type) {
     case DT_REG: *type = ItemType::kRegular; return true;
     case DT_DIR: *type = ItemType::kDirectory; return true;
     case DT_LNK: *type = ItemType::kSymbolicLink; return true;

@@ -34,6 +34,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/directory_listing.h"
 #include "platform/result.h"
 #include "platform/unique_fd.h"
 
@@ -92,10 +93,7 @@ class TreeWalker {
   std::shared_ptr<const UniqueFd> parentDirectory() const;
 
  private:
-  struct Entry {
-    std::string name;
-    uint8_t dtype;  // DT_* from the directory listing
-  };
+  using Entry = DirectoryEntry;
   struct Level {
     std::shared_ptr<const UniqueFd> fd;
     std::string path;
@@ -107,8 +105,6 @@ class TreeWalker {
   // Opens the directory `name` of the innermost level (or the root when
   // parentFd is AT_FDCWD) and pushes it as a new level; errors are reported.
   void enter(int parentFd, const std::string& name, const std::string& path);
-  // The sorted entries of the open directory fd.
-  static Result<std::vector<Entry>> ReadEntries(int fd, const std::string& path);
   // The type of an entry from its listing, or from fstatat where the file
   // system did not say; false (after reporting) when it cannot be read.
   bool typeOf(const Level& level, const Entry& entry, ItemType* type);

@@ -48,6 +48,4 @@ Value XPCDictionaryConversion::initWithXPCDictionary(const XpcDictionary& dictio
   return result;
 }
 
-XpcObject XPCDictionaryConversion::createXPCDictionary(const Value&) { return XpcObject(); }
-
 }  // namespace vtr

@@ -23,8 +23,6 @@ struct XPCDictionaryConversion {
   // The conversion of one dictionary (what dictionaryWithXPCDictionary calls,
   // and what it calls for each nested dictionary).
   static Value initWithXPCDictionary(const XpcDictionary& dictionary);
-  // The reverse direction exists in name only: always null.
-  static XpcObject createXPCDictionary(const Value& dictionary);
 };
 
 }  // namespace vtr

@@ -7,6 +7,7 @@
 #include <random>
 
 #include "platform/output_stream.h"
+#include "platform/paths.h"
 
 namespace vtr {
 namespace {
@@ -22,20 +23,16 @@ std::string RandomSuffix() {
 }  // namespace
 
 Result<AtomicFile> AtomicFile::Create(const std::string& path, mode_t mode) {
-  const size_t slash = path.rfind('/');
-  const std::string dir = slash == std::string::npos ? "." : (slash == 0 ? "/" : path.substr(0, slash));
-  const std::string name = slash == std::string::npos ? path : path.substr(slash + 1);
-  if (name.empty() || name == "." || name == "..") return Error(EINVAL, path);
+  const PathParts parts = SplitLastComponent(path);
+  if (parts.name.empty() || parts.name == "." || parts.name == "..") return Error(EINVAL, path);
 
-  UniqueFd dirFd(::open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (!dirFd) return Error::FromErrno(dir);
+  UniqueFd dirFd(::open(parts.parent.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!dirFd) return Error::FromErrno(parts.parent);
   return CreateIn(std::move(dirFd), path, mode);
 }
 
 Result<AtomicFile> AtomicFile::CreateIn(UniqueFd dirFd, const std::string& path, mode_t mode) {
-  const size_t slash = path.rfind('/');
-  const std::string dir = slash == std::string::npos ? "." : path.substr(0, slash);
-  const std::string name = slash == std::string::npos ? path : path.substr(slash + 1);
+  const auto [dir, name] = SplitLastComponent(path);
   if (name.empty() || name == "." || name == "..") return Error(EINVAL, path);
   for (int attempt = 0; attempt < 100; ++attempt) {
     std::string temp = "." + name + "." + RandomSuffix();

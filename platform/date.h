@@ -18,7 +18,6 @@ struct Date {
   double secondsSince2001 = 0;
 
   static Date FromUnix(int64_t seconds, int64_t nanoseconds = 0);
-  static Date FromUnixSeconds(double seconds) { return Date{seconds - kSecondsFrom1970To2001}; }
   double unixSeconds() const { return secondsSince2001 + kSecondsFrom1970To2001; }
 
   // "2026-11-21 09:30:00 +0000": the description "%@" prints (UTC, whole

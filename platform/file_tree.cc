@@ -1,6 +1,5 @@
 #include "platform/file_tree.h"
 
-#include <dirent.h>
 #include <fcntl.h>
 #include <limits.h>
 #include <sys/stat.h>
@@ -15,8 +14,10 @@
 #include <cstring>
 #include <memory>
 
+#include "platform/directory_listing.h"
 #include "platform/file_manager.h"
 #include "platform/output_stream.h"
+#include "platform/paths.h"
 #include "platform/remove_item.h"
 
 // fchmodat2 (Linux 6.6) has the same number on every architecture; the C
@@ -284,34 +285,19 @@ Result<uint64_t> AllocatedBytesOfTree(int dirFd, const std::string& name, const 
 Result<ParentAndName> OpenParent(const std::string& path) {
   std::string trimmed = path;
   while (trimmed.size() > 1 && trimmed.back() == '/') trimmed.pop_back();
-  const size_t slash = trimmed.rfind('/');
-  const std::string dir = slash == std::string::npos ? "." : (slash == 0 ? "/" : trimmed.substr(0, slash));
-  std::string name = slash == std::string::npos ? trimmed : trimmed.substr(slash + 1);
-  if (name.empty() || name == "." || name == ".." || trimmed == "/") return Error(EINVAL, path);
-  UniqueFd parent(::open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (!parent) return Error::FromErrno(dir);
-  return ParentAndName{std::move(parent), std::move(name)};
+  PathParts parts = SplitLastComponent(trimmed);
+  if (parts.name.empty() || parts.name == "." || parts.name == ".." || trimmed == "/") return Error(EINVAL, path);
+  UniqueFd parent(::open(parts.parent.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!parent) return Error::FromErrno(parts.parent);
+  return ParentAndName{std::move(parent), std::move(parts.name)};
 }
 
 Result<std::vector<std::string>> DirectoryEntryNames(int dirFd, const std::string& pathForErrors) {
-  // readdir needs a stream of its own: a duplicate would share the offset.
-  const int streamFd = ::openat(dirFd, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-  if (streamFd < 0) return Error::FromErrno(pathForErrors);
-  DIR* dir = ::fdopendir(streamFd);
-  if (dir == nullptr) {
-    Error e = Error::FromErrno(pathForErrors);
-    ::close(streamFd);
-    return e;
-  }
+  Result<std::vector<DirectoryEntry>> entries = ReadDirectory(dirFd, pathForErrors);
+  if (!entries.ok()) return entries.error();
   std::vector<std::string> names;
-  errno = 0;
-  while (struct dirent* entry = ::readdir(dir)) {
-    if (std::strcmp(entry->d_name, ".") == 0 || std::strcmp(entry->d_name, "..") == 0) continue;
-    names.emplace_back(entry->d_name);
-  }
-  const int readErrno = errno;
-  ::closedir(dir);
-  if (readErrno != 0) return Error(readErrno, pathForErrors);
+  names.reserve(entries->size());
+  for (DirectoryEntry& entry : *entries) names.push_back(std::move(entry.name));
   return names;
 }
 

@@ -24,8 +24,8 @@ struct ParentAndName {
 };
 Result<ParentAndName> OpenParent(const std::string& path);
 
-// The names in the directory open as dirFd, without "." and "..", in the
-// order the file system gives them. dirFd stays open and is not moved.
+// The names in the directory open as dirFd, without "." and "..", sorted
+// (ReadDirectory without the types). dirFd stays open and is not moved.
 Result<std::vector<std::string>> DirectoryEntryNames(int dirFd, const std::string& pathForErrors);
 
 // Changes the mode of the entry name of dirFd without following a symbolic

@@ -1,6 +1,5 @@
 #include "platform/nvram_store.h"
 
-#include <dirent.h>
 #include <fcntl.h>
 #include <linux/fs.h>
 #include <sys/ioctl.h>
@@ -10,6 +9,7 @@
 #include <algorithm>
 #include <cerrno>
 
+#include "platform/file_tree.h"
 #include "platform/open_beneath.h"
 #include "platform/read_fully.h"
 
@@ -155,20 +155,13 @@ Result<std::optional<std::vector<uint8_t>>> NvramStore::read(std::string_view na
 }
 
 Result<std::vector<NvramStore::Variable>> NvramStore::list() const {
-  // A descriptor of its own: reading a directory moves its offset.
-  UniqueFd listing(::openat(folder_.get(), ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  DIR* dir = listing ? ::fdopendir(listing.get()) : nullptr;
-  if (dir == nullptr) return Error::FromErrno(path_);
-  listing.release();  // the DIR owns it now
+  Result<std::vector<std::string>> files = DirectoryEntryNames(folder_.get(), path_);
+  if (!files.ok()) return files.error();
   std::vector<std::string> names;
   const std::string suffix = "-" + std::string(kVendorGuid);
-  while (const struct dirent* entry = ::readdir(dir)) {
-    const std::string_view file(entry->d_name);
-    if (file.size() > suffix.size() && file.substr(file.size() - suffix.size()) == suffix) {
-      names.emplace_back(file.substr(0, file.size() - suffix.size()));
-    }
+  for (const std::string& file : *files) {
+    if (file.size() > suffix.size() && file.ends_with(suffix)) names.push_back(file.substr(0, file.size() - suffix.size()));
   }
-  ::closedir(dir);
   std::sort(names.begin(), names.end());
   std::vector<Variable> variables;
   for (std::string& name : names) {

@@ -13,11 +13,10 @@ std::string AppendPathComponent(std::string_view base, std::string_view componen
   return out;
 }
 
-std::string LastPathComponent(std::string_view path) {
-  while (path.size() > 1 && path.back() == '/') path.remove_suffix(1);
-  if (path == "/") return "/";
+PathParts SplitLastComponent(std::string_view path) {
   const size_t slash = path.rfind('/');
-  return std::string(slash == std::string_view::npos ? path : path.substr(slash + 1));
+  if (slash == std::string_view::npos) return {".", std::string(path)};
+  return {slash == 0 ? "/" : std::string(path.substr(0, slash)), std::string(path.substr(slash + 1))};
 }
 
 }  // namespace vtr

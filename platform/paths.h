@@ -14,8 +14,14 @@ namespace vtr {
 // its trailing slashes.
 std::string AppendPathComponent(std::string_view base, std::string_view component);
 
-// The text after the last "/" (trailing slashes ignored); "/" for "/".
-std::string LastPathComponent(std::string_view path);
+// path split at its last "/": the folder before it ("/" when the slash is
+// the first character, "." when there is none) and the name after it (""
+// when path ends in "/"). "a/b" gives "a" and "b", "/b" gives "/" and "b".
+struct PathParts {
+  std::string parent;
+  std::string name;
+};
+PathParts SplitLastComponent(std::string_view path);
 
 // True when text starts with prefix.
 inline bool HasPrefix(std::string_view text, std::string_view prefix) { return text.substr(0, prefix.size()) == prefix; }

@@ -1,9 +1,12 @@
 #include "platform/read_fully.h"
 
+#include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
+
+#include "platform/unique_fd.h"
 
 namespace vtr {
 
@@ -26,6 +29,21 @@ Result<std::string> ReadFully(int fd, size_t limit) {
     if (text.size() + static_cast<size_t>(n) > limit) return Error(EFBIG, "more than the limit");
     text.append(chunk, static_cast<size_t>(n));
   }
+}
+
+Result<std::string> ReadFileNamed(const std::string& path, size_t limit) {
+  if (path == "-") return ReadFully(STDIN_FILENO, limit);
+  UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
+  if (!fd) return Error::FromErrno(path);
+  struct stat st;
+  if (::fstat(fd.get(), &st) != 0) return Error::FromErrno(path);
+  if (!S_ISREG(st.st_mode) && !S_ISFIFO(st.st_mode)) return Error::Invalid(path + " is not a regular file");
+  // Opened without blocking (a fifo nobody writes to would hang the open);
+  // read blocking.
+  ::fcntl(fd.get(), F_SETFL, ::fcntl(fd.get(), F_GETFL) & ~O_NONBLOCK);
+  Result<std::string> bytes = ReadFully(fd.get(), limit);
+  if (!bytes.ok()) return Error(bytes.error().code(), path + ": " + bytes.error().message());
+  return bytes;
 }
 
 }  // namespace vtr

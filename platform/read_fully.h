@@ -15,6 +15,11 @@ namespace vtr {
 // read), or the read's errno; retries EINTR. fd stays the caller's.
 Result<std::string> ReadFully(int fd, size_t limit);
 
+// The whole of the regular file (or pipe) at path (links followed: for the tools,
+// which read what their user names), at most limit bytes; "-" reads
+// standard input. Errors name the path.
+Result<std::string> ReadFileNamed(const std::string& path, size_t limit);
+
 }  // namespace vtr
 
 #endif  // VTR_PLATFORM_READ_FULLY_H_

@@ -10,6 +10,7 @@
 
 #include <cstdio>
 
+#include "platform/little_endian.h"
 #include "platform/unique_fd.h"
 
 // The ext4 online resize request, as the kernel defines it (fs/ext4/ext4.h)
@@ -50,9 +51,8 @@ Result<uint64_t> Ext4BytesFromSuperblock(const std::string& device) {
   if (::pread(fd.get(), super, sizeof super, 1024) != static_cast<ssize_t>(sizeof super)) {
     return Error(EIO, device + ": no superblock");
   }
-  auto u32 = [&](size_t at) { return uint32_t{super[at]} | uint32_t{super[at + 1]} << 8 |
-                                     uint32_t{super[at + 2]} << 16 | uint32_t{super[at + 3]} << 24; };
-  if ((super[0x38] | super[0x39] << 8) != 0xEF53) return Error(EINVAL, device + ": not ext4");
+  auto u32 = [&](size_t at) { return LoadU32(super + at); };
+  if (LoadU16(super + 0x38) != 0xEF53) return Error(EINVAL, device + ": not ext4");
   const bool wide = (u32(0x60) & 0x80) != 0;  // INCOMPAT_64BIT: the count has a high half
   const uint64_t blocks = u32(0x04) | (wide ? uint64_t{u32(0x150)} << 32 : 0);
   return blocks * (uint64_t{1024} << u32(0x18));

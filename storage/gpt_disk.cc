@@ -12,7 +12,7 @@
 #include <cstring>
 #include <vector>
 
-#include "storage/little_endian.h"
+#include "platform/little_endian.h"
 #include "storage/utf16.h"
 #include "storage/zarn_layout.h"
 

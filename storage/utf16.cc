@@ -1,6 +1,6 @@
 #include "storage/utf16.h"
 
-#include "storage/little_endian.h"
+#include "platform/little_endian.h"
 
 namespace vtr {
 

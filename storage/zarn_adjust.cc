@@ -6,7 +6,7 @@
 #include <cstring>
 #include <utility>
 
-#include "storage/little_endian.h"
+#include "platform/little_endian.h"
 #include "storage/zarn_diagnostics.h"
 #include "storage/zarn_layout.h"
 

@@ -28,7 +28,7 @@
 #include <string_view>
 #include <type_traits>
 
-#include "storage/little_endian.h"
+#include "platform/little_endian.h"
 
 namespace vtr {
 

@@ -1,7 +1,7 @@
 // The commands a request may name: the one place that maps a request key to
 // the responder's method. A key not in the table is answered as a method the
-// responder does not have; the table holds the 14 command keys and nothing
-// else, so no other method of the responder can be reached by a request.
+// responder does not have; the table holds the command keys and nothing else,
+// so no other method of the responder can be reached by a request.
 #ifndef VTR_VITD_HELPER_COMMAND_TABLE_H_
 #define VTR_VITD_HELPER_COMMAND_TABLE_H_
 

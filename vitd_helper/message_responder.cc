@@ -75,6 +75,5 @@ void VTRHMessageResponder::send(const char* key, XpcObject value) {
 void VTRHMessageResponder::sendPassResponse() { send("Response", XpcObject::Bool(true)); }
 void VTRHMessageResponder::sendFailResponse() { send("Response", XpcObject::Bool(false)); }
 void VTRHMessageResponder::sendProgress(int64_t percent) { send("Progress", XpcObject::Int64(percent)); }
-void VTRHMessageResponder::sendData(const Bytes& bytes) { send("Data", XpcObject::Data(bytes)); }
 
 }  // namespace vtr

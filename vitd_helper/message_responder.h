@@ -49,12 +49,11 @@ class VTRHMessageResponder {
   // peer's: an entitled client's work logs what it must.
   void handleXPCMessage(const XpcObject& request);
 
-  // The four messages, sent on the current connection; dropped when there is
+  // The messages, sent on the current connection; dropped when there is
   // none. None is a reply bound to a request.
   void sendPassResponse();                  // {"Response": true}
   void sendFailResponse();                  // {"Response": false}
   void sendProgress(int64_t percent);       // {"Progress": percent}
-  void sendData(const Bytes& bytes);        // {"Data": bytes}
 
   // The commands. Each takes the request key's value and returns the result
   // that becomes the "Response"; each first logs

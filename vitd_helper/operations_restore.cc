@@ -26,19 +26,11 @@ std::optional<PlistNode> ChooseManifest(const VTRSignedManifest& signedManifest,
   if (!containerType || !identifier) return signedManifest.getManifest();
   const std::string& type = *containerType;
   const std::string& id = *identifier;
-  PlistNode chosen;
-  if (type == "AppData") {
-    const PlistNode container = signedManifest.getAppDataList().get(id);
-    if (container.isNil()) {
-      VTRLogError("Couldn't load container data for %@/%@", type, id);
-      return std::nullopt;
-    }
-    chosen = container.get("Manifest");
-  } else if (type == "GroupData") {
-    chosen = signedManifest.getGroupDataList().get(id);
-  } else if (type == "ExtensionData") {
-    chosen = signedManifest.getPlugInDataList().get(id);
+  if (type == "AppData" && signedManifest.getAppDataList().get(id).isNil()) {
+    VTRLogError("Couldn't load container data for %@/%@", type, id);
+    return std::nullopt;
   }
+  const PlistNode chosen = signedManifest.containerManifest(type, id);
   if (chosen.isNil()) {
     VTRLogError("Couldn't load manifest dict for %@/%@", type, id);
     return std::nullopt;

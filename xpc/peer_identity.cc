@@ -108,12 +108,10 @@ Result<PeerIdentity> PeerIdentity::Capture(int socketFd, int procDirFd) {
   // pid 0: the peer lives in a pid namespace this one cannot see.
   if (identity.pid_ <= 0) return identity;
 
+  // The socket's pidfd is exact; without SO_PEERPIDFD one is looked up by
+  // pid at accept; without pidfds the start time alone pins the process.
   identity.pidfd_ = PidfdFromSocket(socketFd);
-  identity.pidfdSource_ = PidfdSource::kSocket;
-  if (!identity.pidfd_) {
-    identity.pidfd_ = PidfdFromPid(identity.pid_);
-    identity.pidfdSource_ = identity.pidfd_ ? PidfdSource::kPid : PidfdSource::kNone;
-  }
+  if (!identity.pidfd_) identity.pidfd_ = PidfdFromPid(identity.pid_);
   identity.pin(procDirFd);
   return identity;
 }

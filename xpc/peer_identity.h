@@ -34,10 +34,6 @@ Result<UniqueFd> OpenProcDirectory(const std::string& path = "/proc");
 
 class PeerIdentity {
  public:
-  // Where the pidfd came from: the socket (exact), a lookup by pid at accept
-  // (the kernel lacks SO_PEERPIDFD), or nowhere (the kernel lacks pidfds).
-  enum class PidfdSource { kSocket, kPid, kNone };
-
   // Captures the peer of the connected Unix socket socketFd, reading /proc
   // through procDirFd (both borrowed for the call only). An Error only when
   // the socket has no peer credentials. A peer that cannot be pinned down
@@ -51,7 +47,6 @@ class PeerIdentity {
   pid_t pid() const { return pid_; }
   uid_t uid() const { return uid_; }
   gid_t gid() const { return gid_; }
-  PidfdSource pidfdSource() const { return pidfdSource_; }
   // True when the process and its executable were recorded at accept.
   bool pinned() const { return processDir_.valid(); }
 
@@ -72,7 +67,6 @@ class PeerIdentity {
   pid_t pid_ = 0;
   uid_t uid_ = 0;
   gid_t gid_ = 0;
-  PidfdSource pidfdSource_ = PidfdSource::kNone;
   UniqueFd pidfd_;
   UniqueFd processDir_;
   dev_t executableDevice_ = 0;

@@ -6,6 +6,7 @@
 #include <utility>
 
 #include "platform/format.h"
+#include "platform/little_endian.h"
 
 namespace vtr {
 namespace {
@@ -15,12 +16,6 @@ namespace {
 // a tag.
 constexpr size_t kMinObjectBytes = 1;
 constexpr size_t kMinEntryBytes = 4 + 1;
-
-uint32_t LoadU32(const uint8_t* p) {
-  return uint32_t{p[0]} | uint32_t{p[1]} << 8 | uint32_t{p[2]} << 16 | uint32_t{p[3]} << 24;
-}
-
-uint64_t LoadU64(const uint8_t* p) { return uint64_t{LoadU32(p)} | uint64_t{LoadU32(p + 4)} << 32; }
 
 // Reads one object tree from a body, stopping at the first broken rule.
 class Decoder {

@@ -17,7 +17,7 @@
 #include <vector>
 
 #include "platform/unique_fd.h"
-#include "storage/little_endian.h"
+#include "platform/little_endian.h"
 #include "storage/zarn_check.h"
 #include "storage/zarn_chunk.h"
 #include "storage/zarn_export.h"

@@ -6,7 +6,7 @@
 #include <string>
 #include <vector>
 
-#include "storage/little_endian.h"
+#include "platform/little_endian.h"
 #include "storage/zarn_layout.h"
 #include "tests/storage/zarn_test_support.h"
 

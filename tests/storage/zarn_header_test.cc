@@ -4,7 +4,7 @@
 
 #include <algorithm>
 
-#include "storage/little_endian.h"
+#include "platform/little_endian.h"
 #include "storage/zarn_check.h"
 #include "tests/storage/zarn_test_support.h"
 

@@ -15,7 +15,7 @@
 
 #include "platform/unique_fd.h"
 #include "storage/gpt_disk.h"
-#include "storage/little_endian.h"
+#include "platform/little_endian.h"
 #include "storage/zarn_layout.h"
 #include "tests/support/test_support.h"
 

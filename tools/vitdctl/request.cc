@@ -1,27 +1,16 @@
 #include "tools/vitdctl/request.h"
 
 #include <cmath>
-#include <fstream>
-#include <iostream>
-#include <iterator>
-#include <sstream>
 #include <utility>
 
 #include "platform/plist.h"
+#include "platform/read_fully.h"
 
 namespace vtr::vitdctl {
 namespace {
 
-Result<std::string> ReadAll(const std::string& path) {
-  if (path == "-") {
-    return std::string(std::istreambuf_iterator<char>(std::cin), std::istreambuf_iterator<char>());
-  }
-  std::ifstream in(path, std::ios::binary);
-  if (!in) return Error::FromErrno(path);
-  std::stringstream ss;
-  ss << in.rdbuf();
-  return ss.str();
-}
+// A request is a few paths; anything near this is not one.
+constexpr size_t kMaxRequestFileBytes = 16 << 20;
 
 bool LooksLikeJson(const std::string& path, const std::string& text) {
   if (path.size() >= 5 && path.compare(path.size() - 5, 5, ".json") == 0) return true;
@@ -139,7 +128,7 @@ UniqueValue MessageValueOf(const Value& value) {
 }
 
 Result<UniqueValue> ReadRequestFile(const std::string& path) {
-  Result<std::string> text = ReadAll(path);
+  Result<std::string> text = ReadFileNamed(path, kMaxRequestFileBytes);
   if (!text.ok()) return text.error();
   if (LooksLikeJson(path, *text)) {
     vitd_value* request = nullptr;

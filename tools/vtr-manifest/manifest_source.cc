@@ -12,19 +12,11 @@ namespace {
 // Largest file read: far above a whole device's manifest.
 constexpr size_t kMaxFileBytes = size_t{2} << 30;
 
-bool IsSignedManifest(const PlistNode& top) {
-  return top.isDictionary() && top.get("Payload").data().has_value() &&
-         (!top.get("Certificate").isNil() || !top.get("Signature").isNil());
-}
-
 // The manifest of a container in a signed manifest, looked for in
-// "AppData" (under "Manifest"), then "GroupData" and "ExtensionData";
-// nil when none holds it.
+// "AppData", then "GroupData" and "ExtensionData"; nil when none holds it.
 PlistNode ContainerManifest(const VTRSignedManifest& manifest, const std::string& container) {
-  const PlistNode app = manifest.getAppDataList().get(container).get("Manifest");
-  if (app.isDictionary()) return app;
-  for (const PlistNode& list : {manifest.getGroupDataList(), manifest.getPlugInDataList()}) {
-    const PlistNode found = list.get(container);
+  for (const char* type : {"AppData", "GroupData", "ExtensionData"}) {
+    const PlistNode found = manifest.containerManifest(type, container);
     if (found.isDictionary()) return found;
   }
   return PlistNode();
@@ -32,16 +24,7 @@ PlistNode ContainerManifest(const VTRSignedManifest& manifest, const std::string
 
 }  // namespace
 
-Result<std::string> ReadWholeFile(const std::string& path) {
-  UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
-  if (!fd) return Error::FromErrno(path);
-  struct stat st;
-  if (::fstat(fd.get(), &st) != 0) return Error::FromErrno(path);
-  if (!S_ISREG(st.st_mode)) return Error::Invalid(path + " is not a regular file");
-  Result<std::string> bytes = ReadFully(fd.get(), kMaxFileBytes);
-  if (!bytes.ok()) return Error(bytes.error().code(), path + ": " + bytes.error().message());
-  return bytes;
-}
+Result<std::string> ReadWholeFile(const std::string& path) { return ReadFileNamed(path, kMaxFileBytes); }
 
 Result<std::unique_ptr<ManifestSource>> ManifestSource::Load(const ManifestSelection& selection) {
   const std::string& file = selection.file;
@@ -55,7 +38,7 @@ Result<std::unique_ptr<ManifestSource>> ManifestSource::Load(const ManifestSelec
   if (!document.ok()) return Error::Invalid(file + ": " + document.error().message());
   source->document_ = std::move(*document);
   const PlistNode top = source->document_->top();
-  if (!IsSignedManifest(top)) {
+  if (!VTRSignedManifest::LooksSigned(top)) {
     if (selection.container) return Error::Invalid(file + " is not a signed manifest");
     if (!top.isDictionary()) return Error::Invalid(file + " does not hold a dictionary");
     // A manifest maps paths to records; anything else is some other list.

@@ -2,8 +2,8 @@
 // volume-manager header, GPT headers and entries) are read and written field
 // by field through these, never by casting a struct over raw bytes, so the
 // code is independent of host byte order and alignment.
-#ifndef VTR_STORAGE_LITTLE_ENDIAN_H_
-#define VTR_STORAGE_LITTLE_ENDIAN_H_
+#ifndef VTR_PLATFORM_LITTLE_ENDIAN_H_
+#define VTR_PLATFORM_LITTLE_ENDIAN_H_
 
 #include <cstddef>
 #include <cstdint>
@@ -33,4 +33,4 @@ inline void StoreU64(uint8_t* p, uint64_t v) { StoreLittleEndian(p, v); }
 
 }  // namespace vtr
 
-#endif  // VTR_STORAGE_LITTLE_ENDIAN_H_
+#endif  // VTR_PLATFORM_LITTLE_ENDIAN_H_
