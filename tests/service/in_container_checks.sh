@@ -21,6 +21,9 @@ main_pid() { systemctl show -p MainPID --value vitd_helper.service; }
 # mounted before the helper first starts, so its namespace has it.
 mount -t tmpfs -o mode=0755 firmware /sys/firmware && mkdir -p /sys/firmware/efi/efivars
 
+exposure=$(systemd-analyze security vitd_helper.service 2>/dev/null | awk '/Overall exposure level/ { print $(NF - 2) }')
+check "systemd-analyze security rates the service below 3.0 (${exposure:-none})" \
+  awk -v e="${exposure:-10}" 'BEGIN { exit !(e < 3.0) }'
 verify=$(systemd-analyze verify vitd_helper.service vitd_helper.socket 2>&1)
 check "systemd-analyze verify is clean${verify:+: $verify}" [ -z "$verify" ]
 check "the socket listens" [ "$(systemctl is-active vitd_helper.socket)" = active ]

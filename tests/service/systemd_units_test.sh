@@ -8,8 +8,8 @@
 #
 #   systemd_units_test.sh BUILD_DIR            the build, as cmake --install lays it out
 #   systemd_units_test.sh BUILD_DIR DEB...     the Debian packages instead, installed
-#                                              with dpkg; the example client is then
-#                                              built through pkg-config
+#                                              with dpkg
+# Either way the example client is built in the container through pkg-config.
 set -uo pipefail
 build=${1:?usage: systemd_units_test.sh BUILD_DIR [DEB...]}
 shift
@@ -40,7 +40,6 @@ mkdir -p "$work"/{upper,overlay-work,root}
 if [ ${#debs[@]} -eq 0 ]; then
   # The install, as `cmake --install` makes it, in the overlay's upper layer.
   DESTDIR="$work/upper" cmake --install "$build" >/dev/null || { echo "FAIL: cmake --install"; exit 1; }
-  cp "$build/bin/vitd-example" "$work/upper/usr/local/bin/"
 fi
 mount -t overlay overlay -o "lowerdir=/,upperdir=$work/upper,workdir=$work/overlay-work" "$work/root" ||
   skip "cannot mount an overlay of /"
@@ -49,20 +48,23 @@ root=$work/root
 if [ ${#debs[@]} -eq 0 ]; then
   # What the package's scripts do.
   chroot "$root" /bin/sh -e -c '
+    ldconfig
     groupadd --system vitd
     chgrp vitd /usr/local/bin/vitdctl && chmod 0750 /usr/local/bin/vitdctl
     systemctl enable vitd_helper.socket >/dev/null 2>&1' || { echo "FAIL: setting up the install"; exit 1; }
 else
-  # The packages, then the example client built as its README says.
   mkdir -p "$root/tmp/debs" && cp "${debs[@]}" "$root/tmp/debs/"
-  chroot "$root" /bin/sh -e -c '
-    dpkg -i /tmp/debs/*.deb >/tmp/dpkg.log 2>&1 || { cat /tmp/dpkg.log; exit 1; }
-    cc -o /usr/local/bin/vitd-example /usr/share/doc/libvitdclient-dev/examples/vitd-example.c \
-      $(pkg-config --cflags --libs vitdclient)
-    objcopy --add-section .vtr_entitlements="$(pkg-config --variable=entitlement vitdclient)" \
-      --set-section-flags .vtr_entitlements=readonly /usr/local/bin/vitd-example' ||
+  chroot "$root" /bin/sh -e -c 'dpkg -i /tmp/debs/*.deb >/tmp/dpkg.log 2>&1 || { cat /tmp/dpkg.log; exit 1; }' ||
     { echo "FAIL: installing the packages"; exit 1; }
 fi
+# The example client, built as the README says: pkg-config, then the
+# entitlement added with objcopy.
+chroot "$root" /bin/sh -e -c '
+  example=$(pkg-config --variable=prefix vitdclient)/share/doc/libvitdclient-dev/examples/vitd-example.c
+  cc -o /usr/local/bin/vitd-example "$example" $(pkg-config --cflags --libs vitdclient)
+  objcopy --add-section .vtr_entitlements="$(pkg-config --variable=entitlement vitdclient)" \
+    --set-section-flags .vtr_entitlements=readonly /usr/local/bin/vitd-example' ||
+  { echo "FAIL: building the example client through pkg-config"; exit 1; }
 
 # The device's accounts and data area.
 chroot "$root" /bin/sh -e -c '
