@@ -9,6 +9,7 @@
 #include <memory>
 
 #include "model/log.h"
+#include "platform/item_io.h"
 #include "platform/termination.h"
 #include "platform/unique_fd.h"
 
@@ -43,21 +44,10 @@ HashScratch& Scratch() {
 // false on a read error, and when the helper is asked to terminate.
 bool DigestFile(int fd, off_t size, EVP_MD_CTX* context, uint8_t* chunk) {
   if (context == nullptr || EVP_DigestInit_ex(context, Sha1(), nullptr) != 1) return false;
-  ::posix_fadvise(fd, 0, 0, POSIX_FADV_SEQUENTIAL);
-  off_t offset = 0;
-  while (offset < size) {
-    if (TerminationRequested()) return false;
-    const size_t want = static_cast<size_t>(std::min<off_t>(size - offset, kFileHashChunkBytes));
-    const ssize_t n = ::pread(fd, chunk, want, offset);
-    if (n < 0 && errno == EINTR) continue;
-    if (n < 0) return false;
-    if (n == 0) return true;
-    if (EVP_DigestUpdate(context, chunk, static_cast<size_t>(n)) != 1) return false;
-    // The uncached read: the pages just hashed leave the cache again.
-    ::posix_fadvise(fd, offset, n, POSIX_FADV_DONTNEED);
-    offset += n;
-  }
-  return true;
+  return ReadOnce(fd, static_cast<uint64_t>(size), std::span<uint8_t>(chunk, kFileHashChunkBytes),
+                  [context](std::span<const uint8_t> piece) {
+                    return !TerminationRequested() && EVP_DigestUpdate(context, piece.data(), piece.size()) == 1;
+                  });
 }
 
 }  // namespace
@@ -68,18 +58,11 @@ std::optional<Bytes> fileHashAt(int dirFd, const std::string& name, const std::s
   return fileHashOfDescriptor(OpenFileForHashAt(dirFd, name).get(), path);
 }
 
-UniqueFd OpenFileForHashAt(int dirFd, const std::string& name) {
-  // O_NOATIME: taking a manifest of a device should not rewrite the access
-  // time of every file in it. Only the owner (or root) may ask for it.
-  constexpr int kFlags = O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC;
-  UniqueFd fd(::openat(dirFd, name.c_str(), kFlags | O_NOATIME));
-  if (!fd && errno == EPERM) fd.reset(::openat(dirFd, name.c_str(), kFlags));
-  return fd;
-}
+UniqueFd OpenFileForHashAt(int dirFd, const std::string& name) { return OpenForReadingQuietly(dirFd, name); }
 
 std::optional<Bytes> fileHashOfDescriptor(int fd, const std::string& path) {
   struct stat st;
-  if (fd < 0 || ::fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) {
+  if (fd < 0 || !StatOf(fd, &st) || !S_ISREG(st.st_mode)) {
     VTRLogError("Cannot read file %@", path);
     return std::nullopt;
   }

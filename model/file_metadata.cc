@@ -3,7 +3,6 @@
 
 #include <fcntl.h>
 #include <sys/stat.h>
-#include <sys/xattr.h>
 
 #include <cstring>
 
@@ -11,6 +10,7 @@
 #include "model/log.h"
 #include "platform/file_manager.h"
 #include "platform/file_tree.h"
+#include "platform/item_io.h"
 #include "platform/unique_fd.h"
 
 namespace vtr {
@@ -36,7 +36,7 @@ Result<ParentAndName> OpenItemDirectory(const std::string& path) {
   Result<ParentAndName> parent = OpenParent(path);
   if (parent.ok()) return parent;
   if (parent.error().code() != EINVAL || path.empty()) return Error(parent.error().code(), path);
-  UniqueFd self(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  UniqueFd self = OpenAt(AT_FDCWD, path, O_RDONLY | O_DIRECTORY | O_CLOEXEC);
   if (!self) return Error::FromErrno(path);
   return ParentAndName{std::move(self), "."};
 }
@@ -56,7 +56,7 @@ OpenedItem OpenForRecord(int dirFd, const std::string& name, ItemKind kind) {
   if (kind == ItemKind::kRegular) {
     item.fd = OpenFileForHashAt(dirFd, name);
   } else if (kind == ItemKind::kDirectory) {
-    item.fd.reset(::openat(dirFd, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+    item.fd = OpenAt(dirFd, name, kDirectoryFlags | O_NONBLOCK);
   } else {
     return item;
   }
@@ -77,12 +77,12 @@ struct XattrSource {
 };
 
 ssize_t ListXattrs(const XattrSource& item, char* list, size_t size) {
-  if (item.fd >= 0) return ::flistxattr(item.fd, list, size);
+  if (item.fd >= 0) return ListExtendedAttributesOf(item.fd, list, size);
   return ListExtendedAttributesAt(item.dirFd, item.name, list, size, item.mayUsePath ? &item.path : nullptr);
 }
 
 ssize_t GetXattr(const XattrSource& item, const std::string& key, void* value, size_t size) {
-  if (item.fd >= 0) return ::fgetxattr(item.fd, key.c_str(), value, size);
+  if (item.fd >= 0) return GetExtendedAttributeOf(item.fd, key, value, size);
   return GetExtendedAttributeAt(item.dirFd, item.name, key, value, size, item.mayUsePath ? &item.path : nullptr);
 }
 

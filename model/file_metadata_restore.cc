@@ -1,7 +1,6 @@
 // Using a file metadata record: laying it onto an item, comparing two.
 #include <fcntl.h>
 #include <sys/stat.h>
-#include <sys/xattr.h>
 
 #include <array>
 #include <string_view>
@@ -10,6 +9,7 @@
 #include "model/log.h"
 #include "platform/file_manager.h"
 #include "platform/file_tree.h"
+#include "platform/item_io.h"
 #include "platform/unique_fd.h"
 
 namespace vtr {
@@ -70,7 +70,7 @@ bool SetExtendedAttributesWith(const Dictionary* attributes, const std::string& 
 // that cannot be set.
 bool SetExtendedAttributes(const Dictionary* attributes, const std::string& path) {
   return SetExtendedAttributesWith(attributes, path, [&path](const std::string& name, const Bytes& data) {
-    return ::lsetxattr(path.c_str(), name.c_str(), data.data(), data.size(), 0);
+    return SetExtendedAttributeOfPath(path, name, data.data(), data.size());
   });
 }
 
@@ -138,8 +138,8 @@ bool VTRFileMetadata::restoreAttribuesToItemAt(int dirFd, const std::string& nam
   if (type != nullptr && *type == kNSFileTypeSymbolicLink) {
     // A link's own owner; Linux gives links no mode. The result is not
     // checked, as on the platform.
-    (void)::fchownat(dirFd, name.c_str(), static_cast<uid_t>(Int32Attribute(attributes, kNSFileOwnerAccountID)),
-                     static_cast<gid_t>(Int32Attribute(attributes, kNSFileGroupOwnerAccountID)), AT_SYMLINK_NOFOLLOW);
+    (void)ChangeOwnerAt(dirFd, name, static_cast<uid_t>(Int32Attribute(attributes, kNSFileOwnerAccountID)),
+                        static_cast<gid_t>(Int32Attribute(attributes, kNSFileGroupOwnerAccountID)));
     return SetExtendedAttributesWith(getExtendedAttributes(), path, [&](const std::string& key, const Bytes& data) {
       return SetExtendedAttributeAt(dirFd, name, key, data.data(), data.size());
     });
@@ -151,12 +151,12 @@ bool VTRFileMetadata::restoreAttribuesToItemAt(int dirFd, const std::string& nam
   UniqueFd item;
   struct stat st;
   Status set = Status::Ok();
-  if (::fstatat(dirFd, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) {
+  if (!StatAt(dirFd, name, &st)) {
     set = Error::FromErrno(path);
   } else if (!S_ISREG(st.st_mode) && !S_ISDIR(st.st_mode)) {
     set = Error(S_ISLNK(st.st_mode) ? ELOOP : EOPNOTSUPP, path);
   } else {
-    item.reset(::openat(dirFd, name.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+    item = OpenAt(dirFd, name, kReadItemFlags);
     set = item ? SetAttributesOfDescriptor(all, item.get(), path, kAllowedToSet) : Status(Error::FromErrno(path));
   }
   if (!set.ok()) {
@@ -167,7 +167,7 @@ bool VTRFileMetadata::restoreAttribuesToItemAt(int dirFd, const std::string& nam
   // The protection class has no Linux counterpart: setting it succeeds
   // without effect, so its step cannot fail here.
   SetExtendedAttributesWith(getExtendedAttributes(), path, [&item](const std::string& key, const Bytes& data) {
-    return ::fsetxattr(item.get(), key.c_str(), data.data(), data.size(), 0);
+    return SetExtendedAttributeOf(item.get(), key, data.data(), data.size());
   });
   return true;
 }

@@ -12,6 +12,7 @@
 
 #include "platform/file_dates.h"
 #include "platform/file_tree.h"
+#include "platform/item_io.h"
 #include "platform/open_beneath.h"
 #include "platform/paths.h"
 #include "platform/remove_item.h"
@@ -43,16 +44,6 @@ std::string_view CapLine(std::string_view message, std::string* holder) {
   const size_t kept = VTRLogModel::kMaxLogLineBytes - 64;
   *holder = std::string(message.substr(0, kept)) + Format(" ... (%zu more bytes)", message.size() - kept);
   return *holder;
-}
-
-// Creates folder/testWritability.log holding "a" and removes it again.
-bool ProbeWritable(int folder) {
-  const int fd = ::openat(folder, kProbeName, O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC, 0644);
-  if (fd < 0) return false;
-  const bool written = ::write(fd, "a", 1) == 1;
-  ::close(fd);
-  ::unlinkat(folder, kProbeName, 0);
-  return written;
 }
 
 }  // namespace
@@ -124,12 +115,12 @@ void VTRLogModel::systemLogOnly(std::string_view message, LogPriority priority) 
 UniqueFd VTRLogModel::openLogFolder(const std::string& directory) {
   Result<std::vector<std::string>> components = SplitPathComponents(directory);
   if (!components.ok()) return UniqueFd();
-  UniqueFd root(::open("/", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  UniqueFd root = OpenAt(AT_FDCWD, "/", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
   Result<UniqueFd> folder = OpenDirectoryBeneath(root.get(), *components, components->size(), true, 0755);
   if (!folder.ok()) return UniqueFd();
   struct stat st;
-  if (::fstat(folder->get(), &st) != 0) return UniqueFd();
-  if (st.st_uid != ::geteuid() || (st.st_mode & 022) != 0) {
+  if (!StatOf(folder->get(), &st)) return UniqueFd();
+  if (st.st_uid != ThisUser() || (st.st_mode & 022) != 0) {
     systemLogOnly(
         Format("The log folder %s is owned by uid %u with mode %04o, not by this user and closed to others; "
                "logging to the system log only",
@@ -140,11 +131,10 @@ UniqueFd VTRLogModel::openLogFolder(const std::string& directory) {
 }
 
 bool VTRLogModel::openDayFile(int folder, const std::string& name, const std::string& path) {
-  UniqueFd fd(
-      ::openat(folder, name.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC, 0644));
+  UniqueFd fd = OpenAt(folder, name, O_WRONLY | O_APPEND | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC, 0644);
   struct stat st;
   FILE* fp = nullptr;
-  if (fd && ::fstat(fd.get(), &st) == 0 && S_ISREG(st.st_mode) && st.st_uid == ::geteuid() && st.st_nlink == 1) {
+  if (fd && StatOf(fd.get(), &st) && S_ISREG(st.st_mode) && st.st_uid == ThisUser() && st.st_nlink == 1) {
     fp = ::fdopen(fd.get(), "a");
     if (fp != nullptr) fd.release();
   } else if (fd || errno == ELOOP) {
@@ -175,7 +165,7 @@ bool VTRLogModel::logToFileEnabled() const {
 
 bool VTRLogModel::enableLogToFilesUnder(const std::string& directory, const std::string& prefix, long expireDays) {
   UniqueFd folder = openLogFolder(directory);
-  if (!folder || !ProbeWritable(folder.get())) return false;
+  if (!folder || !ProbeWritable(folder.get(), kProbeName)) return false;
 
   std::shared_ptr<Clock> clock;
   {

@@ -11,6 +11,7 @@
 #include "model/tree_walker.h"
 #include "platform/file_manager.h"
 #include "platform/file_tree.h"
+#include "platform/item_io.h"
 #include "platform/paths.h"
 #include "platform/termination.h"
 #include "platform/utf8.h"
@@ -165,10 +166,9 @@ VTRManifest::Fill::Outcome VTRManifest::Fill::processTreeItself(const std::strin
   if (folder(skip, path)) return Outcome::kGoOn;
   const TreeLocation& location = manifest_.treeLocation_;
   struct stat st;
-  const int statted = location.parent
-                          ? ::fstatat(location.parent->get(), location.name.c_str(), &st, AT_SYMLINK_NOFOLLOW)
-                          : ::lstat(path.c_str(), &st);
-  if (statted != 0) {
+  const bool statted =
+      location.parent ? StatAt(location.parent->get(), location.name, &st) : StatAt(AT_FDCWD, path, &st);
+  if (!statted) {
     VTRLogError("Could not get resource for key %@", "NSURLIsRegularFileKey");
     return Outcome::kStopAnswerNo;
   }
@@ -289,7 +289,7 @@ std::optional<std::string> VTRManifest::RelativeKey(const std::string& itemPath,
 }
 
 std::vector<std::string> VTRManifest::immediateHiddenFilesUnderPath(const std::string& directory) {
-  UniqueFd dir(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  UniqueFd dir = OpenAt(AT_FDCWD, directory, kDirectoryFlags);
   return dir ? immediateHiddenFilesIn(dir.get(), directory) : std::vector<std::string>();
 }
 
@@ -317,7 +317,7 @@ uint64_t VTRManifest::calculateTotalFileSize(const std::string& treePath, const 
   while (walker.next()) {
     if (walker.type() != TreeWalker::ItemType::kRegular) continue;
     struct stat st;
-    if (::fstatat(walker.parentFd(), walker.name().c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) {
+    if (!StatAt(walker.parentFd(), walker.name(), &st)) {
       VTRLogError("Cound not get attribute for item %@", walker.path());
       return 0;
     }

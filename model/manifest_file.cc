@@ -3,6 +3,7 @@
 #include <sys/stat.h>
 
 #include "platform/file_manager.h"
+#include "platform/item_io.h"
 
 namespace vtr {
 
@@ -18,7 +19,7 @@ Result<std::unique_ptr<ManifestFileWriter>> ManifestFileWriter::CreateIn(UniqueF
 Result<std::unique_ptr<ManifestFileWriter>> ManifestFileWriter::Make(Result<AtomicFile> file, const std::string& path) {
   if (!file.ok()) return file.error();
   struct stat st;
-  if (::fstat(file->fd(), &st) != 0) return Error::FromErrno(path);
+  if (!StatOf(file->fd(), &st)) return Error::FromErrno(path);
   return std::unique_ptr<ManifestFileWriter>(
       new ManifestFileWriter(std::move(*file), static_cast<int64_t>(st.st_dev), static_cast<uint64_t>(st.st_ino)));
 }

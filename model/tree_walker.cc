@@ -12,13 +12,13 @@
 
 #include "platform/directory_listing.h"
 #include "platform/format.h"
+#include "platform/item_io.h"
 #include "platform/paths.h"
 #include "platform/utf8.h"
 
 namespace vtr {
 namespace {
 
-constexpr int kDirectoryOpenFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
 
 TreeWalker::ItemType TypeFromMode(mode_t mode) {
   if (S_ISREG(mode)) return TreeWalker::ItemType::kRegular;
@@ -58,7 +58,7 @@ void TreeWalker::enter(int parentFd, const std::string& name, const std::string&
     onError_(path, Error::Invalid(Format("nested more than %zu levels deep; not entered", kMaxWalkDepth)));
     return;
   }
-  UniqueFd fd(::openat(parentFd, name.c_str(), kDirectoryOpenFlags));
+  UniqueFd fd = OpenAt(parentFd, name, kDirectoryFlags);
   if (!fd) {
     onError_(path, Error::FromErrno(path));
     return;
@@ -80,7 +80,7 @@ bool TreeWalker::typeOf(const Level& level, const Entry& entry, ItemType* type) 
     default: *type = ItemType::kOther; return true;
   }
   struct stat st;
-  if (::fstatat(level.fd->get(), entry.name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) {
+  if (!StatAt(level.fd->get(), entry.name, &st)) {
     onError_(path_, Error::FromErrno(path_));
     return false;
   }
