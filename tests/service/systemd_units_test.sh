@@ -31,7 +31,9 @@ cleanup() {
     for _ in $(seq 50); do kill -0 "$nspawn_pid" 2>/dev/null || break; sleep 0.1; done
     kill -KILL "$nspawn_pid" 2>/dev/null
   fi
+  umount -l "$work/root/private/var" 2>/dev/null
   umount -l "$work/root" 2>/dev/null
+  if [ -n "${disk:-}" ]; then partx -d "$disk" 2>/dev/null; losetup -d "$disk" 2>/dev/null; fi
   rm -rf "$work"
 }
 trap cleanup EXIT
@@ -66,6 +68,28 @@ chroot "$root" /bin/sh -e -c '
     --set-section-flags .vtr_entitlements=readonly /usr/local/bin/vitd-example' ||
   { echo "FAIL: building the example client through pkg-config"; exit 1; }
 
+# A boot disk for the resize commands where loop devices and the tools are
+# here: GPT with "System" and "Data" (btrfs, mounted as the data area), the
+# volume manager's signature, 4096-byte blocks; bound in as /dev/rdisk0s1.
+disk=
+disk_binds=()
+if command -v sfdisk >/dev/null && command -v mkfs.btrfs >/dev/null && command -v partx >/dev/null &&
+   disk=$(losetup -b 4096 -f --show "$(truncate -s 1280M "$work/disk.img" && echo "$work/disk.img")" 2>/dev/null); then
+  # The layout of the data-partition tests: "Data" second in the table,
+  # behind "Update" on the disk, free blocks after it.
+  printf 'label: gpt\ntable-length: 3\nsector-size: 4096\nstart=256, size=16384, name=System\nstart=33024, size=262144, name=Data\nstart=16640, size=16384, name=Update\n' |
+    sfdisk -q --no-reread --no-tell-kernel "$disk" &&
+    printf 'nraZ' | dd of="$disk" bs=1 seek=440 conv=notrunc status=none && partx -a "$disk" &&
+    mkfs.btrfs -q -f "${disk}p2" >/dev/null && mkdir -p "$root/private/var" && mount "${disk}p2" "$root/private/var" ||
+    { echo "FAIL: preparing the loop disk"; exit 1; }
+  # The disk under its own name too: libblkid reads the table through it.
+  disk_binds=(--bind="$disk:/dev/rdisk0s1" --bind="$disk" --bind="${disk}p2")
+  echo "${disk}p2" > "$work/data-partition"
+else
+  echo "note: no loop disk here; the resize commands will answer false"
+  disk=
+fi
+
 # The device's accounts and data area.
 chroot "$root" /bin/sh -e -c '
   groupadd -g 501 mobile && useradd -u 501 -g 501 -d /var/mobile -M mobile
@@ -78,8 +102,9 @@ chroot "$root" /bin/sh -e -c '
   systemctl mask systemd-firstboot.service systemd-networkd.service >/dev/null 2>&1 || true
 ' || { echo "FAIL: preparing the container's root"; exit 1; }
 cp "$here/in_container_checks.sh" "$root/root/checks.sh"
+[ -n "$disk" ] && echo "$(basename "${disk}")p2" > "$root/root/data-partition"
 
-systemd-nspawn -q -D "$root" --register=no --keep-unit -M vitd-units --boot -- systemd.firstboot=off > "$work/console.log" 2>&1 &
+systemd-nspawn -q -D "$root" --register=no --keep-unit -M vitd-units "${disk_binds[@]}" --boot -- systemd.firstboot=off > "$work/console.log" 2>&1 &
 nspawn_pid=$!
 
 # The container's PID 1, seen from here.
