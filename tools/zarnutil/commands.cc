@@ -46,9 +46,9 @@ bool Consistent(const ZarnImage& image, const ZarnHeaderBuffer& header) {
   return zarnCheckHeader(&image.props, copy.data()) == 0;
 }
 
-int Say(const ZarnutilInvocation& call, const std::string& text) {
+// A note about the image on standard error.
+void Say(const ZarnutilInvocation& call, const std::string& text) {
   std::fprintf(stderr, "zarnutil: %s: %s\n", call.image.c_str(), text.c_str());
-  return 0;
 }
 
 }  // namespace

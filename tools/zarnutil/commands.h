@@ -1,6 +1,7 @@
 // The sub-commands of zarnutil. Each works on one disk image or block device
-// and returns the process exit status: 0 success, 1 failure (with a message
-// on standard error, the library's own where it gives one).
+// and returns the process exit status, one of the tools' common ones
+// (tools/common/tool_conventions.h), after a message on standard error (the
+// library's own where it gives one) when it fails.
 #ifndef VTR_TOOLS_ZARNUTIL_COMMANDS_H_
 #define VTR_TOOLS_ZARNUTIL_COMMANDS_H_
 
