@@ -69,6 +69,22 @@ TEST(ManifestRulesTest, RelativeKey) {
   }
 }
 
+TEST(ManifestRulesTest, PrefixKeyCutsTheRootOffTheFrontOnly) {
+  const struct {
+    std::string item;
+    std::string root;
+    std::optional<std::string> key;
+  } cases[] = {
+      {"/t/xz-utils/tt", "/t", "/xz-utils/tt"}, {"/t/a.b/.c", "/t", "/a.b/.c"}, {"/t", "/t", "/"},
+      {"/t", "/t/", "/"},   {"/tt", "/t", std::nullopt}, {"/x/t/a", "/t", std::nullopt},
+      {"/etc", "/", "/etc"}, {"/", "/", "/"},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.item + " below " + c.root);
+    EXPECT_EQ(VTRManifest::PrefixKey(c.item, c.root), c.key);
+  }
+}
+
 Value RecordOf(const std::string& path) {
   std::optional<VTRFileMetadata> record = VTRFileMetadata::fileMetadatatWithPath(path);
   return record ? record->dict() : Value();
