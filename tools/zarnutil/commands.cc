@@ -63,9 +63,10 @@ Json CopyJson(const HeaderCopy& copy) {
 // What a user can do about copies that are not healthy.
 std::string NextStep(const ZarnutilInvocation& call, const HeaderCopies& copies) {
   if (const HeaderCopy* sound = copies.sound()) {
-    const char* other = sound == &copies.main ? "backup" : "main";
-    return std::string("the ") + other + " copy is not sound; 'zarnutil repair " + call.image + "' restores it from the " +
-           sound->name + " copy";
+    const HeaderCopy& other = sound == &copies.main ? copies.backup : copies.main;
+    return std::string("the ") + other.name + " copy " +
+           (other.condition == CopyCondition::kSound ? "differs from the main one" : "is not sound") +
+           "; 'zarnutil repair " + call.image + "' restores it from the " + sound->name + " copy";
   }
   if (copies.valid() != nullptr) {
     return "no copy is consistent; 'zarnutil repair --dry-run " + call.image +
@@ -152,9 +153,10 @@ int RunRepair(const ZarnutilInvocation& call) {
     report["action"] = "restore";
     report["restored"] = damaged.name;
     report["from"] = source->name;
-    text = std::string(dryRun ? "would restore" : "restoring") + " the " + damaged.name + " header (" +
-           damaged.description() + ") from the sound " + source->name + " copy" + (dryRun ? "; nothing written" : "") +
-           "\n";
+    const std::string why =
+        damaged.condition == CopyCondition::kSound ? "sound, but not the same" : damaged.description();
+    text = std::string(dryRun ? "would restore" : "restoring") + " the " + damaged.name + " header (" + why +
+           ") from the sound " + source->name + " copy" + (dryRun ? "; nothing written" : "") + "\n";
     if (dryRun) return finish(kExitOk);
     const bool written = WriteHeaderCopy(*image, source->bytes, damaged.offset);
     report["written"] = written;
