@@ -76,6 +76,73 @@ std::string NextStep(const ZarnutilInvocation& call, const HeaderCopies& copies)
          "' writes a fresh header (the partitions it listed are lost)";
 }
 
+// What a repair says and answers: text for people, or one JSON object.
+struct RepairReport {
+  const ZarnutilInvocation& call;
+  Json json;
+  std::string text;
+
+  // Prints the report; exitStatus unless printing failed.
+  int finish(int exitStatus) const {
+    const int printed = Print(call.has("--json") ? JsonLine(json) : text);
+    return printed != kExitOk ? printed : exitStatus;
+  }
+};
+
+// Writes source's bytes over the copy damaged (not with --dry-run).
+int RestoreCopy(const ZarnImage& image, const HeaderCopy& damaged, const HeaderCopy& source, RepairReport& report) {
+  const bool dryRun = report.call.has("--dry-run");
+  report.json["action"] = "restore";
+  report.json["restored"] = damaged.name;
+  report.json["from"] = source.name;
+  const std::string why = damaged.condition == CopyCondition::kSound ? "sound, but not the same" : damaged.description();
+  report.text = std::string(dryRun ? "would restore" : "restoring") + " the " + damaged.name + " header (" + why +
+                ") from the sound " + source.name + " copy" + (dryRun ? "; nothing written" : "") + "\n";
+  if (dryRun) return report.finish(kExitOk);
+  const bool written = WriteHeaderCopy(image, source.bytes, damaged.offset);
+  report.json["written"] = written;
+  return report.finish(written ? kExitOk : kExitIoError);
+}
+
+// The library's repair of source, the valid copy, written to both copies:
+// said in a few lines, and held back when it costs partitions data and
+// --force is not given.
+int RepairByRules(const ZarnImage& image, const HeaderCopy& source, RepairReport& report) {
+  const ZarnutilInvocation& call = report.call;
+  report.json["action"] = "repair";
+  report.json["from"] = source.name;
+  ZarnHeaderBuffer repaired = source.bytes;
+  LibraryMessages messages;
+  const bool failed = zarnRepairHeader(&image.props, repaired.data(), call.has("--strict") ? 1 : 0) != 0;
+  const std::vector<std::string> lines = messages.finish();
+  if (failed) {
+    ReplayLibraryMessages(lines);
+    Say(call, "the strict repair stops at the first fault; nothing written");
+    report.json["repaired"] = false;
+    return report.finish(kExitNo);
+  }
+  zarnSetHeaderCRC(repaired.data());
+  const RepairSummary summary = SummariseRepair(image.props, ZarnHeaderView(source.bytes), ZarnHeaderView(repaired));
+  report.json["changes"] = summary.json();
+  report.text = "repairing the " + std::string(source.name) + " copy (" + source.description() +
+                ") by the volume manager's rules; the repair:\n";
+  for (const std::string& line : summary.lines(image.props)) report.text += "  " + line + "\n";
+  if (summary.empty()) report.text += "  changes nothing but the CRC\n";
+  if (call.has("--dry-run")) {
+    report.text += "nothing written (--dry-run)\n";
+    return report.finish(kExitOk);
+  }
+  if (summary.losesData() && !call.has("--force")) {
+    report.text += "nothing written: partitions would lose data; --force applies the repair\n";
+    report.json["needs_force"] = true;
+    return report.finish(kExitNo);
+  }
+  const bool written = WriteHeaderCopies(image, repaired);
+  report.json["written"] = written;
+  if (written) report.text += "both copies written\n";
+  return report.finish(written ? kExitOk : kExitIoError);
+}
+
 }  // namespace
 
 int RunCreate(const ZarnutilInvocation& call) {
@@ -131,75 +198,23 @@ int RunCheck(const ZarnutilInvocation& call) {
 }
 
 int RunRepair(const ZarnutilInvocation& call) {
-  const bool dryRun = call.has("--dry-run");
-  const bool json = call.has("--json");
   int status = kExitOk;
-  std::optional<ZarnImage> image = OpenZarnImage(call.image, !dryRun, call.imageBlockSize, &status);
+  std::optional<ZarnImage> image = OpenZarnImage(call.image, !call.has("--dry-run"), call.imageBlockSize, &status);
   if (!image) return status;
   const HeaderCopies copies = ReadHeaderCopies(*image);
-  Json report = {{"image", call.image}, {"consistent", copies.healthy()}, {"action", "none"}, {"written", false}};
-  std::string text;
-  auto finish = [&](int exitStatus) {
-    const int printed = Print(json ? JsonLine(report) : text);
-    return printed != kExitOk ? printed : exitStatus;
-  };
+  RepairReport report{
+      call, {{"image", call.image}, {"consistent", copies.healthy()}, {"action", "none"}, {"written", false}}, ""};
   if (copies.healthy()) {
-    text = "both header copies are sound and the same; nothing to repair\n";
-    return finish(kExitOk);
+    report.text = "both header copies are sound and the same; nothing to repair\n";
+    return report.finish(kExitOk);
   }
   // A sound copy is the whole answer: the other is made its twin.
   if (const HeaderCopy* source = copies.sound()) {
-    const HeaderCopy& damaged = source == &copies.main ? copies.backup : copies.main;
-    report["action"] = "restore";
-    report["restored"] = damaged.name;
-    report["from"] = source->name;
-    const std::string why =
-        damaged.condition == CopyCondition::kSound ? "sound, but not the same" : damaged.description();
-    text = std::string(dryRun ? "would restore" : "restoring") + " the " + damaged.name + " header (" + why +
-           ") from the sound " + source->name + " copy" + (dryRun ? "; nothing written" : "") + "\n";
-    if (dryRun) return finish(kExitOk);
-    const bool written = WriteHeaderCopy(*image, source->bytes, damaged.offset);
-    report["written"] = written;
-    return finish(written ? kExitOk : kExitIoError);
+    return RestoreCopy(*image, source == &copies.main ? copies.backup : copies.main, *source, report);
   }
-  const HeaderCopy* source = copies.valid();
-  if (source == nullptr) {
-    Say(call, NextStep(call, copies));
-    return kExitBadInput;
-  }
-  // No sound copy: the library's repair, from the valid one.
-  ZarnHeaderBuffer repaired = source->bytes;
-  LibraryMessages messages;
-  const bool failed = zarnRepairHeader(&image->props, repaired.data(), call.has("--strict") ? 1 : 0) != 0;
-  const std::vector<std::string> lines = messages.finish();
-  report["action"] = "repair";
-  report["from"] = source->name;
-  if (failed) {
-    ReplayLibraryMessages(lines);
-    Say(call, "the strict repair stops at the first fault; nothing written");
-    report["repaired"] = false;
-    return finish(kExitNo);
-  }
-  zarnSetHeaderCRC(repaired.data());
-  const RepairSummary summary = SummariseRepair(image->props, ZarnHeaderView(source->bytes), ZarnHeaderView(repaired));
-  report["changes"] = summary.json();
-  text = "repairing the " + std::string(source->name) + " copy (" + source->description() +
-         ") by the volume manager's rules; the repair:\n";
-  for (const std::string& line : summary.lines(image->props)) text += "  " + line + "\n";
-  if (summary.empty()) text += "  changes nothing but the CRC\n";
-  if (dryRun) {
-    text += "nothing written (--dry-run)\n";
-    return finish(kExitOk);
-  }
-  if (summary.losesData() && !call.has("--force")) {
-    text += "nothing written: partitions would lose data; --force applies the repair\n";
-    report["needs_force"] = true;
-    return finish(kExitNo);
-  }
-  const bool written = WriteHeaderCopies(*image, repaired);
-  report["written"] = written;
-  if (written) text += "both copies written\n";
-  return finish(written ? kExitOk : kExitIoError);
+  if (const HeaderCopy* source = copies.valid()) return RepairByRules(*image, *source, report);
+  Say(call, NextStep(call, copies));
+  return kExitBadInput;
 }
 
 int RunExport(const ZarnutilInvocation& call) {
