@@ -458,7 +458,7 @@ class SignedManifestTest(unittest.TestCase):
              "is not a well-formed signed manifest"),
             ("not a property list", self.manifest + ".missing", None, 66, "No such file"),
             ("no anchors folder", signed, os.path.join(self.tmp, "absent"), 66,
-             "cannot use the trust anchors in " + os.path.join(self.tmp, "absent")),
+             "trust anchors folder " + os.path.join(self.tmp, "absent") + ": No such file or directory"),
         ]
         garbage = os.path.join(self.tmp, "garbage.plist")
         with open(garbage, "wb") as f:

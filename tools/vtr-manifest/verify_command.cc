@@ -1,6 +1,9 @@
 // vtr-manifest verify: a signed manifest checked as the helper checks it.
 #include <nlohmann/json.hpp>
 
+#include <cstring>
+#include <string_view>
+
 #include "platform/device_properties.h"
 #include "platform/trust_policy.h"
 #include "tools/vtr-manifest/commands.h"
@@ -21,8 +24,12 @@ bool AnchorsUsable(const SigningAnchors& anchors, Console& console) {
   for (const std::string& folder : folders) {
     Result<TrustPolicy> policy = TrustPolicy::Create(folder, anchors.rootFd);
     if (policy.ok()) return true;
-    problems.push_back("vtr-manifest: cannot use the trust anchors in " + EscapedText(folder) + ": " +
-                       policy.error().description());
+    // The error names the folder itself; the reason is what is left.
+    const Error& error = policy.error();
+    std::string_view why = error.message();
+    if (why == folder) why = std::strerror(error.code());
+    if (why.starts_with(folder + " ")) why.remove_prefix(folder.size() + 1);
+    problems.push_back("vtr-manifest: trust anchors folder " + EscapedText(folder) + ": " + std::string(why));
   }
   for (const std::string& problem : problems) console.print(problem);
   return false;
