@@ -5,6 +5,7 @@
 
 #include <cstdio>
 #include <cstdlib>
+#include <optional>
 
 #include "model/manifest_file.h"
 #include "tools/vtr-manifest/commands.h"
@@ -14,18 +15,40 @@
 namespace vtr::manifest_tool {
 namespace {
 
-// Where "-o -" builds the manifest before it goes to standard output whole:
-// a file of this process's own in the temporary folder.
-std::string StagingPath() {
-  const char* folder = std::getenv("TMPDIR");
-  return std::string(folder != nullptr && *folder != '\0' ? folder : "/tmp") + "/vtr-manifest-" +
-         std::to_string(::getpid()) + ".plist";
-}
+// "-o -": the manifest is made in a folder of this process's own (mode 0700,
+// so no one else can put anything in its place) and goes to standard output
+// only when whole. The folder goes when this does.
+class StagingFolder {
+ public:
+  StagingFolder() {
+    const char* base = std::getenv("TMPDIR");
+    std::string pattern = std::string(base != nullptr && *base != '\0' ? base : "/tmp") + "/vtr-manifest-XXXXXX";
+    if (::mkdtemp(pattern.data()) != nullptr) {
+      folder_ = pattern;
+    } else {
+      error_ = Error::FromErrno("cannot make a folder for the manifest in " + pattern.substr(0, pattern.rfind('/')));
+    }
+  }
+  ~StagingFolder() {
+    if (folder_.empty()) return;
+    ::unlink(file().c_str());
+    ::rmdir(folder_.c_str());
+  }
+  StagingFolder(const StagingFolder&) = delete;
+  StagingFolder& operator=(const StagingFolder&) = delete;
 
-// Copies the file at path to out and removes it; false when out cannot take it.
-bool MoveToOutput(const std::string& path, FILE* out) {
+  // Empty when the folder could not be made; error() then says why.
+  std::string file() const { return folder_.empty() ? "" : folder_ + "/manifest.plist"; }
+  const Error& error() const { return error_; }
+
+ private:
+  std::string folder_;
+  Error error_;
+};
+
+// Copies the file at path to out; false when either fails.
+bool CopyToOutput(const std::string& path, FILE* out) {
   UniqueFd file(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
-  ::unlink(path.c_str());
   if (!file) return false;
   char buffer[65536];
   ssize_t n;
@@ -41,7 +64,15 @@ int RunCreate(const CreateOptions& options, Console& console) {
   WalkOptions walk = options.walk;
   if (int prepared = PrepareWalkOptions(walk, console); prepared != kExitOk) return prepared;
   const bool toStandardOutput = options.output == "-";
-  const std::string output = toStandardOutput ? StagingPath() : options.output;
+  std::optional<StagingFolder> staging;
+  if (toStandardOutput) {
+    staging.emplace();
+    if (staging->file().empty()) {
+      console.print("vtr-manifest: " + staging->error().description());
+      return kExitIoError;
+    }
+  }
+  const std::string output = toStandardOutput ? staging->file() : options.output;
   const std::string shown = toStandardOutput ? "standard output" : EscapedText(options.output);
   Result<std::unique_ptr<ManifestFileWriter>> writer = ManifestFileWriter::Create(output);
   if (!writer.ok()) {
@@ -60,7 +91,7 @@ int RunCreate(const CreateOptions& options, Console& console) {
     console.print("vtr-manifest: cannot write " + shown + ": " + committed.error().description());
     return kExitIoError;
   }
-  if (toStandardOutput && !MoveToOutput(output, stdout)) {
+  if (toStandardOutput && !CopyToOutput(output, stdout)) {
     console.print("vtr-manifest: cannot write the manifest to standard output");
     return kExitIoError;
   }
