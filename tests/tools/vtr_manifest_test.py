@@ -179,12 +179,14 @@ class CreateTest(unittest.TestCase):
         self.assertFalse(os.path.exists(os.path.join(self.tmp, "-")))
 
     def test_keys_relative_to_another_root_and_skips(self):
-        manifest, _ = self.create("--relative-to", self.tmp, "--skip", "dir/sub", "--skip", os.path.join(self.root, "di"))
+        manifest, _ = self.create("--relative-to", self.tmp, "--skip", "dir/sub", "--skip", os.path.join(self.root, "di"),
+                                  "--skip", os.path.relpath(os.path.join(self.root, ".hidden")))  # from here
         keys = set(manifest)
         self.assertIn("/tree/dir/small", keys)
         self.assertNotIn("/tree/dir/sub", keys)
         self.assertFalse(any(k.startswith("/tree/dir/sub/") for k in keys))
         self.assertIn("/tree/dir/link-to-dir", keys)
+        self.assertNotIn("/tree/.hidden", keys)
 
     def test_sequential_and_parallel_files_are_identical(self):
         self.create("--jobs", "0")

@@ -86,7 +86,14 @@ int PrepareWalkOptions(WalkOptions& options, Console& console) {
     options.relativeTo = std::move(*real);
   }
   for (std::string& skip : options.skip) {
-    const std::string resolved = CanonicalItemPath(skip.starts_with('/') ? skip : options.tree + "/" + skip);
+    std::string resolved = CanonicalItemPath(skip.starts_with('/') ? skip : options.tree + "/" + skip);
+    // A relative path is taken below the tree; one that names nothing there
+    // but names something in the tree from the current folder means that.
+    struct stat item;
+    if (!skip.starts_with('/') && ::lstat(resolved.c_str(), &item) != 0) {
+      const std::string fromHere = CanonicalItemPath(skip);
+      if (::lstat(fromHere.c_str(), &item) == 0 && Within(fromHere, options.tree)) resolved = fromHere;
+    }
     if (!Within(resolved, options.tree) || resolved == options.tree) {
       console.print("vtr-manifest: --skip " + EscapedText(skip) + " does not lie inside " + EscapedText(given));
       return kExitUsage;

@@ -21,7 +21,8 @@ namespace vtr::manifest_tool {
 // written: the tree must exist and be a directory (a manifest describes a
 // tree) and becomes its real absolute path; --relative-to likewise, and must
 // be the tree or a folder above it; each --skip (relative ones are taken
-// below the tree) becomes the absolute path it names, links above its last
+// below the tree, or from the current folder when only that names something
+// in the tree) becomes the absolute path it names, links above its last
 // component resolved, and must lie inside the tree. On a fault it says why
 // on the console and returns the exit status (kExitNoInput for a missing
 // tree, kExitBadInput for a file, kExitUsage for the options); else kExitOk.
