@@ -111,7 +111,7 @@ class ZarnutilTest(unittest.TestCase):
             h = restamp(h)
             write_at(self.image, 0, h)
             write_at(self.image, backup_at, h)
-        # (damage, check exit, conditions, repair exit, partitions left, repaired copy matches the other)
+        # name: (damage, check exit, the copies' conditions, repair exit, partitions left after it)
         cases = {
             "healthy": (lambda h: None, 0, ["sound", "sound"], 0, 1),
             "main destroyed": (lambda h: write_at(self.image, 0, os.urandom(4096)), 1, ["not-a-header", "sound"], 0, 1),
