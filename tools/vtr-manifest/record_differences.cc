@@ -140,7 +140,10 @@ std::string ValueText(const nlohmann::json& value) {
   if (value.is_array()) {
     if (value.empty()) return "none";
     std::string text;
-    for (const Json& item : value) text += (text.empty() ? "" : ",") + ValueText(item);
+    for (const Json& item : value) {
+      if (!text.empty()) text += ',';
+      text += ValueText(item);
+    }
     return text;
   }
   return value.dump();

@@ -41,7 +41,10 @@ std::string AbsoluteText(const std::string& path) {
     size_t end = absolute.find('/', at);
     if (end == std::string::npos) end = absolute.size();
     const std::string_view part = std::string_view(absolute).substr(at, end - at);
-    if (!part.empty() && part != ".") out += "/" + std::string(part);
+    if (!part.empty() && part != ".") {
+      out += '/';
+      out += part;
+    }
     at = end + 1;
   }
   return out.empty() ? "/" : out;
