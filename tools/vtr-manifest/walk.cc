@@ -7,6 +7,7 @@
 #include <climits>
 #include <cstdlib>
 #include <cstring>
+#include <optional>
 #include <string_view>
 
 #include "model/progress_updater.h"
@@ -49,7 +50,6 @@ std::string AbsoluteText(const std::string& path) {
   }
   return out.empty() ? "/" : out;
 }
-
 
 }  // namespace
 
