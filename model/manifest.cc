@@ -57,8 +57,11 @@ std::string FileURLString(const std::string& path) {
   return url;
 }
 
+// path may hold a name that is not UTF-8 (what the walker reports as
+// EILSEQ); the log shows it with replacement characters.
 std::string UnwalkableMessage(const char* routine, const std::string& path, const Error& error) {
-  return Format("%s: Could not enumerate %@, url=%@, error=%@", routine, path, FileURLString(path), error);
+  const std::string shown = ToValidUtf8(path);
+  return Format("%s: Could not enumerate %@, url=%@, error=%@", routine, shown, FileURLString(shown), error);
 }
 
 std::string ReplaceAll(std::string_view text, std::string_view pattern, std::string_view replacement) {
@@ -122,6 +125,10 @@ class VTRManifest::Fill {
   Outcome deliver(const std::string& path, const std::string& keyPath, const std::optional<VTRFileMetadata>& record);
 
   const VTRManifest& manifest_;
+  void omit(const std::string& path, const Error& error) const {
+    if (manifest_.omissionHandler_) manifest_.omissionHandler_(path, error);
+  }
+
   const Handler& handler_;
   std::string previousKey_ = "/";
 };
@@ -131,7 +138,8 @@ VTRManifest::Fill::Outcome VTRManifest::Fill::walk(const std::string& treePath, 
   RecordPipeline pipeline(threads, threads == 0 ? 1 : kRecordWindow);
   TreeWalker walker(
       treePath,
-      [&pipeline](const std::string& path, const Error& error) {
+      [this, &pipeline](const std::string& path, const Error& error) {
+        omit(path, error);
         pipeline.submitMessage(UnwalkableMessage(kFillErrorHandler, path, error), LogPriority::kError);
       },
       [&skip](const std::string& path) { return folder(skip, path); }, manifest_.treeLocation_);
@@ -169,6 +177,7 @@ VTRManifest::Fill::Outcome VTRManifest::Fill::processTreeItself(const std::strin
   const bool statted =
       location.parent ? StatAt(location.parent->get(), location.name, &st) : StatAt(AT_FDCWD, path, &st);
   if (!statted) {
+    omit(path, Error::FromErrno(path));
     VTRLogError("Could not get resource for key %@", "NSURLIsRegularFileKey");
     return Outcome::kStopAnswerNo;
   }
@@ -187,14 +196,19 @@ VTRManifest::Fill::Outcome VTRManifest::Fill::deliver(const std::string& path, c
                                                       const std::optional<VTRFileMetadata>& record) {
   // An item outside the root keeps the previous item's key, overwriting its
   // entry: long-standing behaviour that manifests in use rely on.
-  if (std::optional<std::string> key = RelativeKey(keyPath, *manifest_.rootPath_)) previousKey_ = std::move(*key);
+  std::optional<std::string> key = manifest_.keyRule_ == KeyRule::kExactPrefix
+                                      ? PrefixKey(keyPath, *manifest_.rootPath_)
+                                      : RelativeKey(keyPath, *manifest_.rootPath_);
+  if (key) previousKey_ = std::move(*key);
   if (!record) {
+    omit(path, Error(EIO, "its attributes could not be read"));
     VTRLogError("Couldn't get meta data for %@", path);
     return Outcome::kStopAnswerYes;
   }
   // Text that no property list can hold would make the whole manifest
   // unwritable; the item is passed over as one that cannot be walked.
   if (!IsValidUtf8(previousKey_) || !HoldsOnlyUtf8(record->dict())) {
+    omit(path, Error(EILSEQ, ToValidUtf8(path)));
     const std::string shown = ToValidUtf8(path);
     VTRLogModel::sharedInstance().logMessage(UnwalkableMessage(kFillErrorHandler, shown, Error(EILSEQ, shown)),
                                              LogPriority::kError);
@@ -286,6 +300,18 @@ std::optional<std::string> VTRManifest::RelativeKey(const std::string& itemPath,
   std::string key = ReplaceAll(rest, rootPath, "");
   if (key.empty()) key.push_back('/');
   return key;
+}
+
+std::optional<std::string> VTRManifest::PrefixKey(const std::string& itemPath, const std::string& rootPath) {
+  std::string_view root = rootPath;
+  while (!root.empty() && root.back() == '/') root.remove_suffix(1);
+  std::string_view item = itemPath;
+  while (item.size() > 1 && item.back() == '/') item.remove_suffix(1);
+  if (!item.starts_with(root)) return std::nullopt;
+  const std::string_view rest = item.substr(root.size());
+  if (rest.empty() || rest == "/") return std::string("/");
+  if (rest.front() != '/') return std::nullopt;
+  return std::string(rest);
 }
 
 std::vector<std::string> VTRManifest::immediateHiddenFilesUnderPath(const std::string& directory) {

@@ -102,6 +102,22 @@ class VTRManifest {
   // Without it the tree path is resolved as text.
   void setTreeLocation(TreeLocation location) { treeLocation_ = std::move(location); }
 
+  // How keys are made. kRootOccurrences is the rule the helper applies to
+  // the paths its clients send (RelativeKey). kExactPrefix cuts the root path
+  // off the front of the item path and nothing else (PrefixKey), for callers
+  // that give the tree and root in canonical form, so that no two items can
+  // share a key.
+  enum class KeyRule { kRootOccurrences, kExactPrefix };
+  void setKeyRule(KeyRule rule) { keyRule_ = rule; }
+
+  // Told, on the filling thread, of each item that belongs in the manifest
+  // but is left out of it: one that cannot be walked or read, one whose key
+  // or record holds text that is not UTF-8 (error EILSEQ), and the item whose
+  // record could not be made (the fill ends there). The log lines stay as
+  // they are; a tool uses this to report them in its own words.
+  using OmissionHandler = std::function<void(const std::string& path, const Error& error)>;
+  void setOmissionHandler(OmissionHandler handler) { omissionHandler_ = std::move(handler); }
+
   // Worker threads that make records during a fill; 0 makes each record in
   // turn on the calling thread. The default suits the machine.
   void setRecordThreads(unsigned threads) { recordThreads_ = threads; }
@@ -137,6 +153,11 @@ class VTRManifest {
   // with every occurrence removed; "/" for an empty result. nullopt when
   // rootPath does not occur (or is empty).
   static std::optional<std::string> RelativeKey(const std::string& itemPath, const std::string& rootPath);
+  // The key of itemPath below rootPath by exact prefix: "/" for the root
+  // itself, the rest of itemPath (which begins with "/") for an item below
+  // it; nullopt when itemPath does not lie at or below rootPath. A trailing
+  // slash of rootPath is not part of it.
+  static std::optional<std::string> PrefixKey(const std::string& itemPath, const std::string& rootPath);
 
   // The full paths of the entries directly in directory whose names begin
   // with "."; empty when it cannot be listed (not logged).
@@ -164,6 +185,8 @@ class VTRManifest {
   VTRProgressUpdater* progressUpdater_ = nullptr;
   TreeLocation treeLocation_;
   unsigned recordThreads_;
+  KeyRule keyRule_ = KeyRule::kRootOccurrences;
+  OmissionHandler omissionHandler_;
 };
 
 }  // namespace vtr

@@ -108,13 +108,12 @@ bool TreeWalker::next() {
       onError_(path_, Error(ENAMETOOLONG, path_));
       continue;
     }
+    if (skip_ && skip_(path_)) continue;
     if (!IsValidUtf8(entry.name)) {
-      const std::string shown = ToValidUtf8(path_);
-      onError_(shown, Error(EILSEQ, shown));
+      onError_(path_, Error(EILSEQ, ToValidUtf8(path_)));
       continue;
     }
     if (!typeOf(level, entry, &type_)) continue;
-    if (skip_ && skip_(path_)) continue;
     enterCurrent_ = type_ == ItemType::kDirectory;
     return true;
   }

@@ -57,7 +57,10 @@ class TreeWalker {
  public:
   enum class ItemType : uint8_t { kRegular, kDirectory, kSymbolicLink, kOther };
 
-  // Called with the path of what could not be walked and why.
+  // Called with the path of what could not be walked and why. The path is
+  // the item's as it stands, even when a name in it is not UTF-8 (error
+  // EILSEQ, whose message shows it with replacement characters); a skipped
+  // item is never reported.
   using ErrorHandler = std::function<void(const std::string& path, const Error& error)>;
   // Answers true for a path the walk must pass over: such an item is not
   // yielded, and a directory is not entered.

@@ -93,6 +93,15 @@ Result<Bytes> SignRsaSha1(evp_pkey_st* key, std::span<const uint8_t> data) {
   return signature;
 }
 
+Result<bool> KeyMatchesCertificate(evp_pkey_st* key, std::span<const uint8_t> der) {
+  const unsigned char* p = der.data();
+  X509Ptr certificate(d2i_X509(nullptr, &p, static_cast<long>(der.size())));
+  if (!certificate) return OpenSslError("not a DER certificate");
+  const bool matches = X509_check_private_key(certificate.get(), key) == 1;
+  ERR_clear_error();  // a mismatch leaves OpenSSL's reason queued
+  return matches;
+}
+
 Result<CertificateSummary> DescribeCertificate(std::span<const uint8_t> der) {
   const unsigned char* p = der.data();
   X509Ptr certificate(d2i_X509(nullptr, &p, static_cast<long>(der.size())));

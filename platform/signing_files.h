@@ -25,6 +25,11 @@ Result<Bytes> ReadCertificateFile(const std::string& path);
 // VerifyRsaSha1Signature accepts.
 Result<Bytes> SignRsaSha1(evp_pkey_st* key, std::span<const uint8_t> data);
 
+// Whether key is the private key of the DER certificate: true when the
+// certificate's public key belongs to it; an Error for bytes that are no
+// certificate.
+Result<bool> KeyMatchesCertificate(evp_pkey_st* key, std::span<const uint8_t> der);
+
 struct CertificateSummary {
   std::string subject;    // one line, RFC 2253 order ("CN=...,O=...")
   std::string issuer;

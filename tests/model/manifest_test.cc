@@ -47,25 +47,33 @@ TEST(ManifestRulesTest, FolderContains) {
   }
 }
 
-TEST(ManifestRulesTest, RelativeKey) {
+// The helper's rule for the paths clients send, and the exact prefix the
+// tools use, over the same paths.
+TEST(ManifestRulesTest, RelativeAndPrefixKeys) {
+  const std::optional<std::string> none;
   const struct {
     std::string item;
     std::string root;
     std::optional<std::string> key;
+    std::optional<std::string> prefixKey;
   } cases[] = {
-      {"/private/var/mobile/Library/x", "/private/var/mobile", "/Library/x"},
-      {"/private/var/mobile", "/private/var/mobile", "/"},
-      {"/private/var/db", "/private", "/var/db"},
-      {"/r/a/r/b", "/r", "/a/b"},            // every occurrence goes
-      {"/x/r/a", "/r", "/a"},                // found later: the rest after it
-      {"/x/r/a/r/b", "/r", "/a/b"},
-      {"/q/a", "/r", std::nullopt},          // not found: the fill reuses the previous key
-      {"/a", "", std::nullopt},
-      {"/private/var/mobile/x", "/private/var/mobile/", "x"},
+      {"/private/var/mobile/Library/x", "/private/var/mobile", "/Library/x", "/Library/x"},
+      {"/private/var/mobile", "/private/var/mobile", "/", "/"},
+      {"/private/var/db", "/private", "/var/db", "/var/db"},
+      {"/r/a/r/b", "/r", "/a/b", "/a/r/b"},  // every occurrence goes
+      {"/x/r/a", "/r", "/a", none},          // found later: the rest after it
+      {"/x/r/a/r/b", "/r", "/a/b", none},
+      {"/q/a", "/r", none, none},            // not found: the fill reuses the previous key
+      {"/a", "", none, "/a"},
+      {"/private/var/mobile/x", "/private/var/mobile/", "x", "/x"},
+      {"/t/xz-utils/tt", "/t", "/xz-utilst", "/xz-utils/tt"},
+      {"/tt", "/t", "t", none},
+      {"/etc", "/", "etc", "/etc"},
   };
   for (const auto& c : cases) {
     SCOPED_TRACE(c.item + " relative to " + c.root);
     EXPECT_EQ(VTRManifest::RelativeKey(c.item, c.root), c.key);
+    EXPECT_EQ(VTRManifest::PrefixKey(c.item, c.root), c.prefixKey);
   }
 }
 

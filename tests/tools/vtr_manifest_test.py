@@ -28,8 +28,8 @@ TYPES = {
 }
 
 
-def run(*args, timeout=120):
-    return subprocess.run([os.path.join(BIN, "vtr-manifest"), *args], capture_output=True, timeout=timeout)
+def run(*args, timeout=120, cwd=None):
+    return subprocess.run([os.path.join(BIN, "vtr-manifest"), *args], capture_output=True, timeout=timeout, cwd=cwd)
 
 
 def make_tree(root):
@@ -132,17 +132,61 @@ class CreateTest(unittest.TestCase):
         for key, record in manifest.items():
             with self.subTest(key=key):
                 self.check_record(key, record)
+        self.assertEqual(stderr, "")  # the model's log lines only with --verbose
+        _, stderr = self.create("--verbose")
         for special in ("fifo", "sock"):
             self.assertIn(os.path.join(self.root, "dir", special) + " is special file. Leave it along", stderr)
 
+    def test_every_spelling_of_the_tree_gives_the_same_keys(self):
+        for name in ("tree", "x.tree.y", "README.gz", "tt"):  # names that hold the tree's name, and dots
+            with open(os.path.join(self.root, name), "w") as f:
+                f.write(name)
+        os.symlink(self.root, os.path.join(self.tmp, "link"))
+        expected = expected_keys(self.root, inclusive=False)
+        spellings = [(self.root, None), ("tree", self.tmp), ("./tree/", self.tmp), ("tree//.", self.tmp),
+                     (".", self.root), ("link", self.tmp), (os.path.join(self.tmp, "link") + "/", None)]
+        for spelling, cwd in spellings:
+            with self.subTest(spelling=spelling):
+                result = run("create", spelling, "-o", self.out, cwd=cwd)
+                self.assertEqual(result.returncode, 0, result.stderr)
+                with open(self.out, "rb") as f:
+                    self.assertEqual(set(plistlib.load(f)), expected)
+                # An unchanged tree compares equal in any other spelling.
+                other = spellings[(spellings.index((spelling, cwd)) + 3) % len(spellings)]
+                compared = run("compare", self.out, other[0], cwd=other[1])
+                self.assertEqual((compared.returncode, compared.stdout), (0, b""), compared.stderr)
+        # A manifest written inside the tree, named relatively: the same keys,
+        # and it compares equal to the tree that now holds it.
+        result = run("create", ".", "-o", "m.plist", "--skip", "dir", cwd=self.root)
+        self.assertEqual(result.returncode, 0, result.stderr)
+        with open(os.path.join(self.root, "m.plist"), "rb") as f:
+            self.assertEqual(set(plistlib.load(f)), {k for k in expected if not k.startswith("/dir")})
+        compared = run("compare", "m.plist", ".", "--skip", "dir", cwd=self.root)
+        self.assertEqual(compared.returncode, 0, compared.stdout)
+
+    def test_names_that_are_not_utf8_fail_and_are_named(self):
+        manifest, _ = self.create()
+        os.mknod(os.path.join(self.root.encode(), b"dir/bad\xff name"))
+        for args in (["create", self.root, "-o", self.out], ["compare", self.out, self.root]):
+            with self.subTest(command=args[0]):
+                result = run(*args)
+                self.assertEqual(result.returncode, 65, result.stderr)
+                self.assertIn(b"/dir/bad\\xff name: ", result.stderr)
+                with open(self.out, "rb") as f:
+                    self.assertEqual(plistlib.load(f), manifest)  # left as it was
+        result = run("create", self.root, "-o", "-", "--skip", b"dir/bad\xff name", cwd=self.tmp)
+        self.assertEqual(set(plistlib.loads(result.stdout)), set(manifest))
+        self.assertFalse(os.path.exists(os.path.join(self.tmp, "-")))
+
     def test_keys_relative_to_another_root_and_skips(self):
-        manifest, _ = self.create("--relative-to", self.tmp, "--skip", os.path.join(self.root, "dir/sub"),
-                                  "--skip", os.path.join(self.root, "di"))
+        manifest, _ = self.create("--relative-to", self.tmp, "--skip", "dir/sub", "--skip", os.path.join(self.root, "di"),
+                                  "--skip", os.path.relpath(os.path.join(self.root, ".hidden")))  # from here
         keys = set(manifest)
         self.assertIn("/tree/dir/small", keys)
         self.assertNotIn("/tree/dir/sub", keys)
         self.assertFalse(any(k.startswith("/tree/dir/sub/") for k in keys))
         self.assertIn("/tree/dir/link-to-dir", keys)
+        self.assertNotIn("/tree/.hidden", keys)
 
     def test_sequential_and_parallel_files_are_identical(self):
         self.create("--jobs", "0")
@@ -162,10 +206,10 @@ class CreateTest(unittest.TestCase):
                 fd = next_fd
         finally:
             os.close(fd)
-        manifest, stderr = self.create()
-        self.assertIn("/n" * 513, manifest)
-        self.assertNotIn("/n" * 514, manifest)
-        self.assertIn("not entered", stderr)
+        result = run("create", self.root, "-o", self.out)
+        self.assertEqual(result.returncode, 74)
+        self.assertIn(b"nested more than 512 levels deep; not entered", result.stderr)
+        self.assertFalse(os.path.exists(self.out))  # never a manifest with a part left out
 
     def test_unwritable_output_fails_and_writes_nothing(self):
         result = run("create", self.root, "-o", os.path.join(self.tmp, "absent", "m.plist"))
@@ -274,23 +318,32 @@ class ShowAndCompareTest(unittest.TestCase):
         os.remove(os.path.join(r, "dir/big"))
         with open(os.path.join(r, "new"), "w") as f:
             f.write("")
-        self.assertEqual(self.compare(), (1, [
-            "- not-in-manifest /new",
-            "0 missing-on-disk /dir/big",
-            "1 type-differs /dir/chunk",
-            "2 content-differs /dir/small",
-            "3 link-target-differs /dir/link-to-file",
-            "4 owner-or-mode-differs /dir/empty",
-            "5 xattrs-differ /dir/sub",
-        ]))
-        # The same as one JSON document.
-        result = run("compare", self.out, self.root, "--json")
+        os.setxattr(os.path.join(r, "dir/empty"), "user.added", b"")
+        os.utime(os.path.join(r, "dir/sub/deeper"), ns=(0, 1_500_000_000_123_456_000))
+        result = run("compare", self.out, r, "--json")
         self.assertEqual(result.returncode, 1)
         document = json.loads(result.stdout)
         self.assertFalse(document["matches"])
-        self.assertIn({"code": None, "name": "not-in-manifest", "path": "/new"}, document["differences"])
-        self.assertIn({"code": 2, "name": "content-differs", "path": "/dir/small"}, document["differences"])
-        self.assertEqual(len(document["differences"]), 7)
+        found = {d["path"]: (d["status"], {c["key"]: (c["expected"], c["found"]) for c in d.get("changes", [])})
+                 for d in document["differences"]}
+        small = self.manifest["/dir/small"]
+        self.assertEqual(found["/new"], ("extra", {}))
+        self.assertEqual(found["/dir/big"], ("missing", {}))
+        self.assertEqual(found["/dir/chunk"][1]["type"], ("NSFileTypeRegular", "NSFileTypeDirectory"))
+        self.assertEqual(found["/dir/small"][1]["size"], (10, 14))
+        self.assertEqual(found["/dir/small"][1]["digest"][0], small["VTRManifestFileHash"].hex())
+        self.assertEqual(found["/dir/link-to-file"][1]["link target"], ("small", "elsewhere"))
+        self.assertEqual(found["/dir/empty"][1]["mode"], ("0644", "0600"))
+        self.assertEqual(found["/dir/empty"][1]["xattrs"], ([], ["user.added"]))
+        self.assertIn("xattr user.on-a-dir", found["/dir/sub"][1])
+        self.assertEqual(found["/dir/sub/deeper"], ("changed", {"modification time": (
+            found["/dir/sub/deeper"][1]["modification time"][0], "2017-07-14T02:40:00.123456Z")}))
+        # The same as text, a path and then each key with both values.
+        lines = run("compare", self.out, r).stdout.decode().splitlines()
+        self.assertIn("/dir/small changed", lines)
+        self.assertIn("\tsize expected 10, found 14", lines)
+        self.assertIn("/new extra", lines)
+        self.assertIn("/dir/big missing", lines)
 
     def test_usage_errors(self):
         for args in ([], ["frobnicate"], ["create", self.root], ["show"], ["show", self.out, "--format", "yaml"],
@@ -381,7 +434,8 @@ class SignedManifestTest(unittest.TestCase):
                 result = self.verify(signed)
                 self.assertEqual(result.returncode, 0, result.stderr)
                 self.assertIn(f"{len(records)} records", result.stdout.decode())
-                self.assertIn("Manifest passed signature check.", result.stderr.decode())
+                self.assertEqual(result.stderr, b"")
+                self.assertIn(b"Manifest passed signature check.", self.verify(signed, None, "--verbose").stderr)
                 verdict = json.loads(self.verify(signed, None, "--json").stdout)
                 self.assertEqual((verdict["trusted"], verdict["cause"], verdict["records"]), (True, None, len(records)))
                 # The signed manifest shows and compares as the manifest it holds.
@@ -397,24 +451,27 @@ class SignedManifestTest(unittest.TestCase):
             outer["Payload"] = bytes(payload)
 
         cases = [
-            ("another root", signed, self.other_anchors, 5, "Certificate not valid."),
+            ("another root", signed, self.other_anchors, 5, "no trusted root vouches for its certificates"),
             ("a flipped payload byte", self.rewritten(signed, "flipped.plist", flip), None, 6,
              "the signature does not sign the payload"),
             ("outer version 3", self.rewritten(signed, "v3.plist", lambda o: o.update(Version=3)), None, 4,
-             "signed manifest version 3 is not supported yet"),
+             "its version is not supported"),
             ("no certificates", self.rewritten(signed, "nocert.plist", lambda o: o.pop("Certificate")), None, 3,
-             "cannot find certificates, or certificate format not correct."),
+             "is not a well-formed signed manifest"),
             ("not a property list", self.manifest + ".missing", None, 66, "No such file"),
+            ("no anchors folder", signed, os.path.join(self.tmp, "absent"), 66,
+             "trust anchors folder " + os.path.join(self.tmp, "absent") + ": No such file or directory"),
         ]
         garbage = os.path.join(self.tmp, "garbage.plist")
         with open(garbage, "wb") as f:
             f.write(b"bplist00 not really")
-        cases.append(("garbage", garbage, None, 3, "Cannot convert to property list"))
+        cases.append(("garbage", garbage, None, 3, "is not a well-formed signed manifest"))
         for name, path, anchors, status, message in cases:
             with self.subTest(name=name):
                 result = self.verify(path, anchors)
                 self.assertEqual(result.returncode, status, result.stderr)
                 self.assertIn(message, result.stderr.decode())
+                self.assertNotIn(b"-[VTR", result.stderr)
                 if status in (3, 4, 5, 6):  # a verdict, also as JSON
                     verdict = json.loads(self.verify(path, anchors, "--json").stdout)
                     self.assertEqual((verdict["file"], verdict["trusted"]), (path, False))
@@ -442,13 +499,18 @@ class SignedManifestTest(unittest.TestCase):
 
     def test_sign_refuses_what_it_cannot_use(self):
         signed = self.sign("refuse.plist")
+        other_key = os.path.join(self.tmp, "other.key")  # made with the other PKI's signer
         for args in (["--key", self.cert, "--certificate", self.cert],                # no private key
                      ["--key", self.key, "--certificate", self.key],                  # no certificate
+                     ["--key", other_key, "--certificate", self.cert],               # not the certificate's key
                      ["--key", self.key, "--certificate", self.cert, "--app-data", f"a={signed}"]):  # signed
             with self.subTest(args=args):
                 result = run("sign", self.manifest, "-o", os.path.join(self.tmp, "never.plist"), *args)
                 self.assertEqual(result.returncode, 65, result.stderr)
                 self.assertFalse(os.path.exists(os.path.join(self.tmp, "never.plist")))
+        with open(signed, "rb") as f:
+            self.assertEqual(run("sign", self.manifest, "--key", self.key, "--certificate", self.cert, "-o", "-")
+                             .stdout[:8], f.read(8))
         for args in (["sign", self.manifest, "-o", "x"], ["sign", self.manifest, "--key", self.key, "-o", "x"],
                      ["sign", self.manifest, "--key", self.key, "--certificate", self.cert, "-o", "x",
                       "--app-data", "no-equals"],

@@ -58,7 +58,7 @@ struct ShowOptions {
 struct CompareOptions {
   ManifestSelection manifest;
   WalkOptions walk;
-  bool json = false;  // one JSON document instead of a line per difference
+  bool json = false;  // one JSON document instead of lines
 };
 
 // A signed manifest made of manifests: the payload holds the whole-device
@@ -87,29 +87,34 @@ struct InspectOptions {
   bool json = false;
 };
 
-// Writes the manifest of the tree to options.output, streamed exactly as the
-// helper writes the device manifest. 0 when the fill succeeded and the file
-// was written.
+// Writes the manifest of the tree to options.output ("-": standard output),
+// streamed exactly as the helper writes the device manifest, keyed by the
+// items' paths below the tree's canonical path. 0 when every item was
+// described and the file written; nothing is written when an item could not
+// be (kExitBadInput: a name that is not UTF-8; kExitIoError: unreadable).
 int RunCreate(const CreateOptions& options, Console& console);
 
 // Prints a manifest (or one entry of it) in the chosen format.
 int RunShow(const ShowOptions& options, FILE* out, Console& console);
 
-// Walks the tree and compares each item with the manifest's record of it,
-// printing one line per difference: "CODE NAME PATH" with the comparison's
-// code, "0 missing-on-disk PATH" for a manifest entry nothing on disk
-// matched, "- not-in-manifest PATH" for an item the manifest lacks. 0 only
-// when no line was printed.
+// Walks the tree as create does (the manifest file itself left out when it
+// lies in the tree) and compares each item with the manifest's record of
+// it: "PATH changed" and a line per differing key ("\tKEY expected OLD,
+// found NEW", see record_differences.h), "PATH missing" for an entry nothing
+// on disk matched, "PATH extra" for an item the manifest lacks; or all of it
+// as one JSON document. 0 only when nothing differs; an item that could not
+// be described fails as in create.
 int RunCompare(const CompareOptions& options, FILE* out, Console& console);
 
 // Builds the payload of options' manifests, signs it and writes the signed
-// manifest to options.output.
+// manifest to options.output ("-": standard output). A key that does not
+// belong to the first certificate is refused (kExitBadInput).
 int RunSign(const SignOptions& options, Console& console);
 
 // Reads the signed manifest as the helper does, with its messages, and
 // answers by cause: 0 trusted and well signed, else kExitMalformed,
 // kExitUnsupportedVersion, kExitNotTrusted, kExitBadSignature, or
-// kExitError when the file cannot be read.
+// kExitNoInput when the file or the trust anchors' folder cannot be used.
 int RunVerify(const VerifyOptions& options, FILE* out, Console& console);
 
 // Prints the outer fields of a signed manifest (version, each certificate's

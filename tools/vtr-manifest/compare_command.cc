@@ -11,16 +11,11 @@
 #include "tools/vtr-manifest/commands.h"
 #include "tools/vtr-manifest/manifest_render.h"
 #include "tools/vtr-manifest/manifest_source.h"
+#include "tools/vtr-manifest/record_differences.h"
 #include "tools/vtr-manifest/walk.h"
 
 namespace vtr::manifest_tool {
 namespace {
-
-// Names of the comparison codes, by code.
-constexpr const char* kDifferenceNames[] = {
-    "missing-on-disk", "type-differs", "content-differs", "link-target-differs",
-    "owner-or-mode-differs", "xattrs-differ", "same",
-};
 
 // The entries of a manifest found by path, and which of them were met: 16
 // bytes and a bit per entry, whatever the paths' length.
@@ -57,39 +52,56 @@ class EntryIndex {
 }  // namespace
 
 int RunCompare(const CompareOptions& options, FILE* out, Console& console) {
-  if (int checked = CheckWalkOptions(options.walk, console); checked != kExitOk) return checked;
+  WalkOptions walk = options.walk;
+  if (int prepared = PrepareWalkOptions(walk, console); prepared != kExitOk) return prepared;
   Result<std::unique_ptr<ManifestSource>> source = ManifestSource::Load(options.manifest);
   if (!source.ok()) {
     console.print("vtr-manifest: " + source.error().description());
     return ExitStatusOfLoad(source.error());
   }
+  // A manifest kept inside the tree it describes is not part of it.
+  const std::string manifestPath = CanonicalItemPath(options.manifest.file);
+  if (manifestPath.starts_with(walk.tree + "/")) walk.skip.push_back(manifestPath);
   const PlistNode& expected = (*source)->records();
   EntryIndex index(expected);
   bool differs = false;
   bool built = true;
-  nlohmann::json differences = nlohmann::json::array();
-  // One difference: a line now, or an entry of the JSON document at the end.
-  auto report = [&](std::optional<int> code, const char* name, const std::string& key) {
+  using Json = nlohmann::ordered_json;  // members in the order written
+  Json differences = Json::array();
+  // One path's difference: lines now, or an entry of the JSON document at
+  // the end. status: "changed", "missing" (in the manifest, not on disk) or
+  // "extra" (on disk, not in the manifest).
+  auto report = [&](const std::string& key, const char* status, const std::vector<Difference>& changes) {
     differs = true;
     if (options.json) {
-      differences.push_back({{"code", code ? nlohmann::json(*code) : nlohmann::json(nullptr)}, {"name", name},
-                             {"path", key}});
-    } else {
-      std::fprintf(out, "%s %s %s\n", code ? std::to_string(*code).c_str() : "-", name, EscapedText(key).c_str());
+      Json entry = {{"path", key}, {"status", status}};
+      if (!changes.empty()) {
+        entry["changes"] = Json::array();
+        for (const Difference& d : changes) {
+          entry["changes"].push_back({{"key", d.key}, {"expected", Json(d.expected)}, {"found", Json(d.found)}});
+        }
+      }
+      differences.push_back(std::move(entry));
+      return;
+    }
+    std::fprintf(out, "%s %s\n", EscapedText(key).c_str(), status);
+    for (const Difference& d : changes) {
+      std::fprintf(out, "\t%s expected %s, found %s\n", d.key.c_str(), ValueText(d.expected).c_str(),
+                   ValueText(d.found).c_str());
     }
   };
-  const bool filled = RunWalk(
-      options.walk,
+  const WalkOutcome outcome = RunWalk(
+      walk,
       [&](const VTRFileMetadata& onDisk, const std::string& key) {
         const std::optional<uint64_t> entry = index.meet(key);
         if (!entry) {
-          report(std::nullopt, "not-in-manifest", key);
+          report(key, "extra", {});
           return true;
         }
         Result<Value> record = expected.valueAt(*entry).value();
         if (!record.ok()) return built = false;
-        const int code = VTRFileMetadata(*record).compareWith(&onDisk);
-        if (code != kVTRFileSame) report(code, kDifferenceNames[code], key);
+        const std::vector<Difference> changes = DifferencesBetween(VTRFileMetadata(*record), onDisk);
+        if (!changes.empty()) report(key, "changed", changes);
         return true;
       },
       console);
@@ -97,19 +109,17 @@ int RunCompare(const CompareOptions& options, FILE* out, Console& console) {
     console.print("vtr-manifest: a record of the manifest is too large to build");
     return kExitBadInput;
   }
+  // What the walk could not describe is neither missing nor the same.
+  const int walked = ReportWalkOutcome(outcome, console);
+  if (walked != kExitOk) return walked;
   for (uint64_t i = 0; i < expected.count(); ++i) {
-    if (index.met(i)) continue;
-    report(kVTRFileOtherAbsent, kDifferenceNames[kVTRFileOtherAbsent], expected.keyAt(i));
+    if (!index.met(i)) report(expected.keyAt(i), "missing", {});
   }
   if (options.json) {
-    const nlohmann::json document = {{"matches", !differs}, {"differences", std::move(differences)}};
-    std::fprintf(out, "%s\n", document.dump(-1, ' ', false, nlohmann::json::error_handler_t::replace).c_str());
+    const Json document = {{"matches", !differs}, {"differences", std::move(differences)}};
+    std::fprintf(out, "%s\n", document.dump(-1, ' ', false, Json::error_handler_t::replace).c_str());
   }
   if (std::fflush(out) != 0) return kExitIoError;
-  if (!filled) {
-    console.print("vtr-manifest: the tree could not be walked to its end");
-    return kExitIoError;
-  }
   return differs ? kExitNo : kExitOk;
 }
 

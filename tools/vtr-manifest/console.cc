@@ -3,17 +3,11 @@
 #include <string>
 
 #include "model/log_model.h"
-#include "platform/paths.h"
 
 namespace vtr::manifest_tool {
 namespace {
 
 constexpr int kBarWidth = 40;
-
-// The progress updater's messages, which the bar replaces.
-bool IsProgressChatter(std::string_view message) {
-  return HasPrefix(message, "Initializing percent with total ") || HasPrefix(message, "Percentage increased to ");
-}
 
 }  // namespace
 
@@ -21,7 +15,10 @@ Console::Console(FILE* err, bool drawProgress, bool verbose)
     : err_(err), drawProgress_(drawProgress), verbose_(verbose) {}
 
 void Console::write(std::string_view message, LogPriority) {
-  if (drawProgress_ && !verbose_ && IsProgressChatter(message)) return;
+  if (verbose_) print(message);
+}
+
+void Console::print(std::string_view message) {
   std::lock_guard<std::mutex> lock(mutex_);
   if (barShown_) std::fputs("\r\033[K", err_);
   std::fprintf(err_, "%.*s\n", static_cast<int>(message.size()), message.data());

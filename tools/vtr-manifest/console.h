@@ -1,6 +1,8 @@
-// What vtr-manifest shows on standard error while it works: the messages the
-// manifest builder logs, one per line, and on a terminal a progress bar kept
-// on the line below them.
+// What vtr-manifest shows on standard error while it works: its own
+// messages, with --verbose the messages the model logs (the helper's log
+// lines, which name the helper's internals and are not meant for a user
+// otherwise), one per line, and on a terminal a progress bar kept on the line
+// below them.
 #ifndef VTR_TOOLS_VTR_MANIFEST_CONSOLE_H_
 #define VTR_TOOLS_VTR_MANIFEST_CONSOLE_H_
 
@@ -17,16 +19,17 @@ namespace vtr::manifest_tool {
 class Console final : public SystemLog {
  public:
   // Writes to err (not owned). With drawProgress, showProgress draws a bar.
-  // Unless verbose, the progress updater's own messages are left out where a
-  // bar shows the same thing.
+  // With verbose, the model's log lines are shown too.
   Console(FILE* err, bool drawProgress, bool verbose);
 
   bool drawsProgress() const { return drawProgress_; }
 
-  // One message on its own line (the bar, if any, is drawn again below it).
-  // May be called from any thread.
+  // A log line of the model: shown only with verbose. May be called from any
+  // thread.
   void write(std::string_view message, LogPriority priority) override;
-  void print(std::string_view message) { write(message, LogPriority::kNotice); }
+  // One message of the tool on its own line (the bar, if any, is drawn again
+  // below it). May be called from any thread.
+  void print(std::string_view message);
   // Draws the bar at percent (shown capped at 100).
   void showProgress(int64_t percent);
   // Ends the bar's line, if one was drawn.

@@ -3,6 +3,7 @@
 #include "model/file_metadata.h"
 #include "platform/file_manager.h"
 #include "platform/format.h"
+#include "platform/utf8.h"
 
 namespace vtr::manifest_tool {
 namespace {
@@ -28,16 +29,24 @@ std::string EscapedText(std::string_view text) {
   static constexpr char kHex[] = "0123456789abcdef";
   std::string out;
   out.reserve(text.size());
-  for (const unsigned char c : text) {
+  for (size_t i = 0; i < text.size();) {
+    const unsigned char c = static_cast<unsigned char>(text[i]);
+    // A whole, valid UTF-8 sequence stays as it is.
+    const size_t length = c < 0x80 ? 1 : (c >> 5) == 6 ? 2 : (c >> 4) == 14 ? 3 : (c >> 3) == 30 ? 4 : 0;
     if (c == '\\') {
       out += "\\\\";
-    } else if (c < 0x20 || c == 0x7f) {
+    } else if (length > 1 && i + length <= text.size() && IsValidUtf8(text.substr(i, length))) {
+      out.append(text.substr(i, length));
+      i += length;
+      continue;
+    } else if (length != 1 || c < 0x20 || c == 0x7f) {
       out += "\\x";
       out += kHex[c >> 4];
       out += kHex[c & 15];
     } else {
       out += static_cast<char>(c);
     }
+    ++i;
   }
   return out;
 }

@@ -1,4 +1,7 @@
 // vtr-manifest sign: a signed manifest made of manifest files.
+#include <cerrno>
+#include <cstdio>
+
 #include "platform/plist.h"
 #include "platform/signing_files.h"
 #include "tools/vtr-manifest/commands.h"
@@ -75,6 +78,14 @@ Status Sign(const SignOptions& options) {
     if (!der.ok()) return der.error();
     certificates.push_back(Value::Data(std::move(*der)));
   }
+  // A signature the signer's certificate cannot verify would make a file
+  // no one can trust.
+  Result<bool> matches = KeyMatchesCertificate(key->get(), *certificates.front().data());
+  if (!matches.ok()) return matches.error();
+  if (!*matches) {
+    return Error::Invalid("the key " + options.key + " does not belong to the certificate " +
+                          options.certificates.front() + " (the signer's, given first)");
+  }
   Result<Value> payload = BuildPayload(options);
   if (!payload.ok()) return payload.error();
   Result<Bytes> payloadBytes = Encode(*payload, options.xml);
@@ -85,7 +96,15 @@ Status Sign(const SignOptions& options) {
                                           {"Certificate", Value::ArrayOf(std::move(certificates))},
                                           {"Payload", Value::Data(std::move(*payloadBytes))},
                                           {"Signature", Value::Data(std::move(*signature))}});
-  return WritePropertyListFile(options.output, file, options.xml ? PlistFormat::kXml : PlistFormat::kBinary);
+  if (options.output != "-") {
+    return WritePropertyListFile(options.output, file, options.xml ? PlistFormat::kXml : PlistFormat::kBinary);
+  }
+  Result<Bytes> bytes = Encode(file, options.xml);
+  if (!bytes.ok()) return bytes.error();
+  if (std::fwrite(bytes->data(), 1, bytes->size(), stdout) != bytes->size() || std::fflush(stdout) != 0) {
+    return Error(EIO, "writing the signed manifest to standard output");
+  }
+  return Status::Ok();
 }
 
 }  // namespace
@@ -93,7 +112,7 @@ Status Sign(const SignOptions& options) {
 int RunSign(const SignOptions& options, Console& console) {
   if (Status signed_ = Sign(options); !signed_.ok()) {
     console.print("vtr-manifest: " + signed_.error().description());
-    return ExitStatusOfLoad(signed_.error());
+    return signed_.error().code() == EIO ? kExitIoError : ExitStatusOfLoad(signed_.error());
   }
   return kExitOk;
 }

@@ -1,10 +1,41 @@
 // vtr-manifest verify: a signed manifest checked as the helper checks it.
 #include <nlohmann/json.hpp>
 
+#include <cstring>
+#include <string_view>
+
+#include "platform/device_properties.h"
+#include "platform/trust_policy.h"
 #include "tools/vtr-manifest/commands.h"
+#include "tools/vtr-manifest/manifest_render.h"
 #include "tools/vtr-manifest/manifest_source.h"
 
 namespace vtr::manifest_tool {
+namespace {
+
+// Whether the trust anchors the check consults can be used: the production
+// folder, and on a device that says it is not fused the test folder, which
+// the check falls back to. A folder missing, unreadable or without a
+// certificate is no reason to call a manifest untrusted; it is said as such.
+bool AnchorsUsable(const SigningAnchors& anchors, Console& console) {
+  std::vector<std::string> folders = {anchors.production};
+  if (SigningFuse(anchors.efiVariables, anchors.rootFd) == false) folders.push_back(anchors.test);
+  std::vector<std::string> problems;
+  for (const std::string& folder : folders) {
+    Result<TrustPolicy> policy = TrustPolicy::Create(folder, anchors.rootFd);
+    if (policy.ok()) return true;
+    // The error names the folder itself; the reason is what is left.
+    const Error& error = policy.error();
+    std::string_view why = error.message();
+    if (why == folder) why = std::strerror(error.code());
+    if (why.starts_with(folder + " ")) why.remove_prefix(folder.size() + 1);
+    problems.push_back("vtr-manifest: trust anchors folder " + EscapedText(folder) + ": " + std::string(why));
+  }
+  for (const std::string& problem : problems) console.print(problem);
+  return false;
+}
+
+}  // namespace
 
 int RunVerify(const VerifyOptions& options, FILE* out, Console& console) {
   Result<std::string> bytes = ReadWholeFile(options.file);
@@ -12,7 +43,9 @@ int RunVerify(const VerifyOptions& options, FILE* out, Console& console) {
     console.print("vtr-manifest: " + bytes.error().description());
     return ExitStatusOfLoad(bytes.error());
   }
-  // The helper's own messages reach the console through the log.
+  if (!AnchorsUsable(options.anchors, console)) return kExitNoInput;
+  // The helper's own messages reach the console through the log only with
+  // --verbose; the verdict below says the cause in the tool's words.
   SignedManifestFailure failure = SignedManifestFailure::kNone;
   std::optional<VTRSignedManifest> manifest =
       VTRSignedManifest::signedManifestWithBytes(std::move(*bytes), options.anchors, &failure);

@@ -22,12 +22,17 @@ struct ZarnutilInvocation {
 
 // Writes a fresh header (both copies) for the medium's geometry.
 int RunCreate(const ZarnutilInvocation& call);
-// Prints the acquired header as text, or as JSON with --json.
+// Prints the acquired header as text (the chunk map with --chunks), or as
+// JSON with --json.
 int RunShow(const ZarnutilInvocation& call);
-// Exit 0 when the acquired header is consistent with the medium.
+// Reports both header copies; exit 0 only when both are sound and the same,
+// kExitNo when either is not, kExitBadInput when neither is valid.
 int RunCheck(const ZarnutilInvocation& call);
-// Repairs the acquired header and writes both copies; with --strict a fault
-// fails and nothing is written.
+// Restores a copy that is not sound from the sound one; with no sound copy,
+// repairs the valid one by the library's rules and writes both copies,
+// unless the repair deletes or cuts short partitions and --force is not
+// given (kExitNo, nothing written). --strict: the library's first fault
+// fails the repair. --dry-run: says what it would do, writes nothing.
 int RunRepair(const ZarnutilInvocation& call);
 // Prints the exported partitions and their extents, as JSON with --json.
 int RunExport(const ZarnutilInvocation& call);

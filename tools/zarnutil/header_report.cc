@@ -26,7 +26,7 @@ std::string Line(const char* label, const std::string& value) {
 
 }  // namespace
 
-std::string HeaderText(const ZarnMediaProperties& props, ZarnHeaderView header) {
+std::string HeaderText(const ZarnMediaProperties& props, ZarnHeaderView header, bool chunks) {
   std::string out;
   out += Line("header kind:", KindName(header));
   out += Line("media size:", std::to_string(header.mediaSize()) + " (" + HumanSize(header.mediaSize()) + ")");
@@ -50,6 +50,7 @@ std::string HeaderText(const ZarnMediaProperties& props, ZarnHeaderView header) 
                   Hex(entry.attributes(), 16).c_str(), JsonQuote(EntryName(entry)).c_str());
     out += line;
   }
+  if (!chunks) return out;
   out += "chunk map:\n";
   for (uint32_t row = 0; row < kZarnChunkMapSlots; row += 16) {
     out += "  " + Hex(row, 3) + ":";

@@ -11,8 +11,9 @@
 namespace vtr {
 
 // The header's fields, the medium's geometry, each listed partition (at most
-// eight, whatever the count claims) and the chunk map, 16 slots a line.
-std::string HeaderText(const ZarnMediaProperties& props, ZarnHeaderView header);
+// eight, whatever the count claims) and, with chunks, the chunk map, 16
+// slots a line.
+std::string HeaderText(const ZarnMediaProperties& props, ZarnHeaderView header, bool chunks);
 
 // {"media_size", "media_identity", "partition_count", "crc", "flags",
 //  "partitions": [{"index", "type", "identity", "begin", "end",

@@ -24,10 +24,12 @@ constexpr char kUsage[] =
     "commands:\n"
     "  create IMAGE     write a fresh header (main and backup copies); refuses\n"
     "                   to replace a header already there unless --force\n"
-    "  show IMAGE       print the header: fields, partitions, chunk map\n"
-    "  check IMAGE      exit 0 when the header is consistent, 1 if not\n"
-    "  repair IMAGE     repair the header and write both copies; a header that\n"
-    "                   passes the check is left alone unless --force\n"
+    "  show IMAGE       print the header: fields, partitions (--chunks: the map)\n"
+    "  check IMAGE      report both header copies; exit 0 when both are sound\n"
+    "                   and the same, 1 when either is not\n"
+    "  repair IMAGE     restore a damaged copy from the sound one; with no sound\n"
+    "                   copy, repair by the volume manager's rules (a repair\n"
+    "                   that deletes partitions needs --force)\n"
     "  export IMAGE     print the partitions with their extents\n"
     "  map IMAGE        draw the chunk map (32 x 32, one mark a chunk)\n"
     "  disk DISK        the boot disk as the data-partition resize sees it:\n"
@@ -40,14 +42,16 @@ constexpr char kUsage[] =
     "  --json           show, check, repair, export, disk: print JSON\n"
     "  --strict         repair: fail on the first fault and write nothing\n"
     "  --dry-run        create, repair: say what would be written, write nothing\n"
-    "  --force          create: replace an existing header; repair: repair a\n"
-    "                   header that passes the check too\n"
+    "  --force          create: replace an existing header; repair: apply a\n"
+    "                   repair that deletes or cuts short partitions\n"
+    "  --chunks         show: print the chunk map too\n"
     "  -h, --help       show this help\n"
     "  -V, --version    show the version\n"
     "\n"
-    "Exit status: 0 done, 1 the check found a fault (or a strict repair failed),\n"
-    "64 usage error, 65 no valid header (or one in the way of create), 66 the image\n"
-    "cannot be opened, 74 reading or writing the image failed.\n";
+    "Exit status: 0 done, 1 a header copy is not sound (check), a strict repair\n"
+    "failed or a repair needs --force, 64 usage error, 65 no valid header (or one\n"
+    "in the way of create, or a medium empty or too small), 66 the image cannot\n"
+    "be opened, 74 reading or writing the image failed.\n";
 
 struct Command {
   const char* name;
@@ -57,7 +61,7 @@ struct Command {
 
 constexpr Command kCommands[] = {
     {"create", "--dry-run --force", vtr::RunCreate},
-    {"show", "--json", vtr::RunShow},
+    {"show", "--json --chunks", vtr::RunShow},
     {"check", "--json", vtr::RunCheck},
     {"repair", "--strict --dry-run --force --json", vtr::RunRepair},
     {"export", "--json", vtr::RunExport},
@@ -91,13 +95,14 @@ bool Takes(const Command& command, const std::string& option) {
 }  // namespace
 
 int main(int argc, char** argv) {
-  enum { kBlockSize = 256, kJson, kStrict, kDryRun, kForce };
+  enum { kBlockSize = 256, kJson, kStrict, kDryRun, kForce, kChunks };
   static const struct option kLongOptions[] = {
       {"block-size", required_argument, nullptr, kBlockSize},
       {"json", no_argument, nullptr, kJson},
       {"strict", no_argument, nullptr, kStrict},
       {"dry-run", no_argument, nullptr, kDryRun},
       {"force", no_argument, nullptr, kForce},
+      {"chunks", no_argument, nullptr, kChunks},
       {"help", no_argument, nullptr, 'h'},
       {"version", no_argument, nullptr, 'V'},
       {nullptr, 0, nullptr, 0},
@@ -115,6 +120,7 @@ int main(int argc, char** argv) {
       case kStrict: call.flags.insert("--strict"); break;
       case kDryRun: call.flags.insert("--dry-run"); break;
       case kForce: call.flags.insert("--force"); break;
+      case kChunks: call.flags.insert("--chunks"); break;
       case 'h': std::fputs(kUsage, stdout); return 0;
       case 'V': vtr::tools::PrintVersion("zarnutil"); return 0;
       case ':': return UsageError(std::string(argv[optind - 1]) + " needs a value");

@@ -13,6 +13,7 @@
 #include "storage/zarn_acquire.h"
 #include "storage/zarn_header.h"
 #include "tools/common/tool_conventions.h"
+#include "tools/zarnutil/library_messages.h"
 
 namespace vtr {
 namespace {
@@ -57,7 +58,29 @@ std::optional<ZarnImage> OpenZarnImage(const std::string& path, bool writable, u
     PrintError(path, blockCount.error());
     return std::nullopt;
   }
-  if (zarnInitMediaGeometry(&image.props, *blockCount * *blockSize, *blockSize) != 0) return std::nullopt;
+  const uint64_t mediaSize = *blockCount * *blockSize;
+  if (mediaSize == 0) {
+    std::fprintf(stderr, "zarnutil: %s: the medium is empty (0 bytes): there is no room for a Zarn header\n",
+                 path.c_str());
+    return std::nullopt;
+  }
+  // The library only warns of a medium too small ("media too small"); the
+  // tool refuses it in its own words below.
+  LibraryMessages geometryMessages;
+  const bool measured = zarnInitMediaGeometry(&image.props, mediaSize, *blockSize) == 0;
+  std::vector<std::string> lines = geometryMessages.finish();
+  std::erase(lines, "media too small");
+  ReplayLibraryMessages(lines);
+  if (!measured) return std::nullopt;
+  if (image.props.chunkSize <= image.props.blockSize) {
+    std::fprintf(stderr,
+                 "zarnutil: %s: the medium (%llu bytes) is too small for a Zarn header: its chunks would be %llu "
+                 "bytes, no larger than a block (%u bytes), so chunk 0 cannot hold the main and backup copies\n",
+                 path.c_str(), static_cast<unsigned long long>(mediaSize),
+                 static_cast<unsigned long long>(image.props.chunkSize),
+                 image.props.blockSize);
+    return std::nullopt;
+  }
   return image;
 }
 
@@ -71,18 +94,20 @@ bool HasHeaderCopy(const ZarnImage& image) {
   return zarnValidateHeader(header.data()) != -2;
 }
 
-bool WriteHeaderCopies(const ZarnImage& image, const ZarnHeaderBuffer& header) {
-  std::vector<uint8_t> block(image.props.blockSize, 0);
+uint64_t BackupHeaderOffset(const ZarnImage& image) { return image.props.chunkSize - image.props.blockSize; }
+
+bool WriteHeaderCopy(const ZarnImage& image, const ZarnHeaderBuffer& header, uint64_t offset) {
+  const char* which = offset == 0 ? "the main header" : "the backup header";
+  std::vector<uint8_t> block(std::max<size_t>(image.props.blockSize, header.size()), 0);
   std::copy(header.begin(), header.end(), block.begin());
-  if (!WriteAt(image.fd.get(), block, 0)) {
-    PrintError(image.path, Error::FromErrno("writing the main header"));
+  block.resize(image.props.blockSize);
+  if (offset + block.size() > image.props.mediaSize) {
+    std::fprintf(stderr, "zarnutil: %s: %s would lie past the end of the medium; nothing written\n",
+                 image.path.c_str(), which);
     return false;
   }
-  if (image.props.chunkSize < image.props.blockSize) {
-    std::fprintf(stderr, "zarnutil: %s: chunk 0 is smaller than a block: no backup header written\n",
-                 image.path.c_str());
-  } else if (!WriteAt(image.fd.get(), block, image.props.chunkSize - image.props.blockSize)) {
-    PrintError(image.path, Error::FromErrno("writing the backup header"));
+  if (!WriteAt(image.fd.get(), block, offset)) {
+    PrintError(image.path, Error::FromErrno(std::string("writing ") + which));
     return false;
   }
   if (::fsync(image.fd.get()) != 0) {
@@ -90,6 +115,11 @@ bool WriteHeaderCopies(const ZarnImage& image, const ZarnHeaderBuffer& header) {
     return false;
   }
   return true;
+}
+
+bool WriteHeaderCopies(const ZarnImage& image, const ZarnHeaderBuffer& header) {
+  // One copy is whole and synced before the other is touched.
+  return WriteHeaderCopy(image, header, 0) && WriteHeaderCopy(image, header, BackupHeaderOffset(image));
 }
 
 }  // namespace vtr

@@ -24,9 +24,10 @@ struct ZarnImage {
 };
 
 // Opens path (for writing too when writable) and computes its geometry. On
-// failure prints why on standard error (the library's message when the
-// geometry is refused), sets *exitStatus (the file cannot be opened, or it is
-// not a medium the library takes) and returns nothing.
+// failure prints why on standard error, sets *exitStatus (kExitNoInput: the
+// file cannot be opened; kExitBadInput: it is not a medium the library takes,
+// or one too small for a header: empty, or with chunks no larger than a
+// block, so that chunk 0 cannot hold two header copies) and returns nothing.
 std::optional<ZarnImage> OpenZarnImage(const std::string& path, bool writable, uint32_t imageBlockSize,
                                        int* exitStatus);
 
@@ -38,9 +39,16 @@ bool AcquireHeader(const ZarnImage& image, ZarnHeaderBuffer* header);
 // or with a wrong CRC (no messages: create asks before it overwrites).
 bool HasHeaderCopy(const ZarnImage& image);
 
-// Writes header, padded to a block with zeros, as the main copy at byte 0 and
-// the backup copy in the last block of chunk 0, and syncs the medium. False
-// after a message on standard error.
+// Where the backup copy lies: the last block of chunk 0.
+uint64_t BackupHeaderOffset(const ZarnImage& image);
+
+// Writes header, padded to a block with zeros, at offset (0 for the main copy,
+// BackupHeaderOffset for the backup) and syncs the medium. Nothing is written
+// past the medium's end, so a file never changes size. False after a message
+// on standard error.
+bool WriteHeaderCopy(const ZarnImage& image, const ZarnHeaderBuffer& header, uint64_t offset);
+
+// WriteHeaderCopy of both copies, the main copy first.
 bool WriteHeaderCopies(const ZarnImage& image, const ZarnHeaderBuffer& header);
 
 }  // namespace vtr
