@@ -13,6 +13,11 @@
 
 #include "platform/base64.h"
 #include "xpc/client.h"
+#include "xpc/message_validator.h"
+#include "xpc/wire_codec.h"
+
+static_assert(VITD_MAX_FRAME_BYTES == vtr::kMaxFrameBodyBytes);
+static_assert(VITD_MAX_DECODE_FACTOR == vtr::kDecodeCostFactor);
 
 // A value under construction: containers collect their items until the
 // value is sent or read, scalars and received values are finished objects.
@@ -146,6 +151,8 @@ int StatusOfReceiveError(int code) {
       return VITD_ERROR_TIMEOUT;
     case EPROTO:
       return VITD_ERROR_PROTOCOL;
+    case EMSGSIZE:
+      return VITD_ERROR_TOO_LARGE;
     case ENOMEM:
       return VITD_ERROR_NO_MEMORY;
     default:
@@ -213,6 +220,9 @@ const char* vitd_strerror(int status) {
       return "stopped by the message callback";
     case VITD_ERROR_BAD_JSON:
       return "not JSON (or nested deeper than 64 levels)";
+    case VITD_ERROR_TOO_LARGE:
+      return "the helper sent a message larger than 16 MiB or one that would take more than four times its size to "
+             "decode";
     default:
       return "unknown status";
   }
