@@ -8,6 +8,7 @@
 #include <unistd.h>
 
 #include <cstdlib>
+#include <cstring>
 #include <string>
 #include <thread>
 #include <vector>
@@ -158,14 +159,16 @@ TEST_F(VitdClientTest, TheHelperClosingBeforeTheResponseIsToldAndASendAfterItFai
 
 // A whole 16 MiB frame {"x": [object, object, ...]} of copies of one encoded object.
 std::vector<uint8_t> FrameOfMany(const std::vector<uint8_t>& object) {
-  const std::vector<uint8_t> head = {0x0A, 1, 0, 0, 0, 1, 0, 0, 0, 'x', 0x09};
-  const uint32_t count = static_cast<uint32_t>((kMaxFrameBodyBytes - head.size() - 4) / object.size());
-  std::vector<uint8_t> frame;
-  const auto append = [&](uint32_t n) { frame.insert(frame.end(), {uint8_t(n), uint8_t(n >> 8), uint8_t(n >> 16), uint8_t(n >> 24)}); };
-  append(static_cast<uint32_t>(head.size() + 4 + size_t{count} * object.size()));
-  frame.insert(frame.end(), head.begin(), head.end());
-  append(count);
-  for (uint32_t i = 0; i < count; ++i) frame.insert(frame.end(), object.begin(), object.end());
+  const uint8_t head[] = {0x0A, 1, 0, 0, 0, 1, 0, 0, 0, 'x', 0x09};
+  const uint32_t count = static_cast<uint32_t>((kMaxFrameBodyBytes - sizeof head - 4) / object.size());
+  const uint32_t body = static_cast<uint32_t>(sizeof head + 4 + size_t{count} * object.size());
+  std::vector<uint8_t> frame(4 + size_t{body});
+  std::memcpy(frame.data(), &body, 4);  // little-endian, as the machine
+  std::memcpy(frame.data() + 4, head, sizeof head);
+  std::memcpy(frame.data() + 4 + sizeof head, &count, 4);
+  for (size_t at = 8 + sizeof head; at < frame.size(); at += object.size()) {
+    std::memcpy(frame.data() + at, object.data(), object.size());
+  }
   return frame;
 }
 
@@ -191,9 +194,6 @@ TEST_F(VitdClientTest, AFrameOverTheLimitsIsNeverDecodedAndSpendsTheClient) {
     HelperSends(XpcObject::Dictionary({{"Response", XpcObject::Bool(true)}}));
     EXPECT_EQ(vitd_receive(client_, nullptr, nullptr), c.status);
   }
-  EXPECT_STREQ(vitd_strerror(VITD_ERROR_TOO_LARGE),
-               "the helper sent a message larger than 16 MiB or one that would take more than four times its size to "
-               "decode");
 }
 
 TEST(VitdClient, ConnectingWhereNothingListensAndBadArgumentsAreErrors) {
