@@ -3,16 +3,25 @@
 // never lets an exception out.
 #include "client/vitd_client.h"
 
+#include <algorithm>
 #include <cerrno>
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <new>
 #include <nlohmann/json.hpp>
 #include <optional>
 #include <string>
+#include <utility>
+#include <vector>
 
 #include "platform/base64.h"
 #include "xpc/client.h"
+#include "xpc/message_validator.h"
+#include "xpc/wire_codec.h"
+
+static_assert(VITD_MAX_FRAME_BYTES == vtr::kMaxFrameBodyBytes);
+static_assert(VITD_MAX_DECODE_FACTOR == vtr::kDecodeCostFactor);
 
 // A value under construction: containers collect their items until the
 // value is sent or read, scalars and received values are finished objects.
@@ -56,47 +65,112 @@ vitd_value* NewValue(vtr::XpcObject object) {
   return Guarded([&]() -> vitd_value* { return new vitd_value{std::move(object), {}, {}}; }, nullptr);
 }
 
-std::string Base64(const uint8_t* bytes, size_t size) {
-  std::string out;
-  vtr::AppendBase64(std::span<const uint8_t>(bytes, size), &out);
-  return out;
+// A scalar or a string as JSON prints it (invalid UTF-8 replaced).
+template <typename T>
+void PutJson(const T& value, FILE* out) {
+  std::fputs(Json(value).dump(-1, ' ', false, Json::error_handler_t::replace).c_str(), out);
 }
 
-Json ToJson(const vtr::XpcObject& object) {
+// bytes in base64, quoted, a slice at a time: no copy of the whole text.
+void PutBase64(std::span<const uint8_t> bytes, FILE* out) {
+  constexpr size_t kSlice = 3 * 16384;  // whole groups of three: no padding midway
+  std::string text;
+  std::fputc('"', out);
+  for (size_t at = 0; at < bytes.size(); at += kSlice) {
+    text.clear();
+    vtr::AppendBase64(bytes.subspan(at, std::min(kSlice, bytes.size() - at)), &text);
+    std::fputs(text.c_str(), out);
+  }
+  std::fputc('"', out);
+}
+
+// Writes object to out as one line of JSON, dictionary keys in sorted order,
+// straight from the object: the text of a large message costs only itself,
+// never a JSON tree and copies of it besides.
+void PutJson(const vtr::XpcObject& object, FILE* out) {
   using Type = vtr::XpcObject::Type;
   switch (object.type()) {
     case Type::kNull:
-      return nullptr;
+      std::fputs("null", out);
+      return;
     case Type::kBool:
-      return *object.boolValue();
+      std::fputs(*object.boolValue() ? "true" : "false", out);
+      return;
     case Type::kInt64:
-      return *object.int64Value();
+      return PutJson(*object.int64Value(), out);
     case Type::kUint64:
-      return *object.uint64Value();
+      return PutJson(*object.uint64Value(), out);
     case Type::kDouble:
-      return *object.doubleValue();
+      return PutJson(*object.doubleValue(), out);
     case Type::kDate:
-      return *object.dateValue();
+      return PutJson(*object.dateValue(), out);
     case Type::kData:
-      return Base64(object.data()->data(), object.data()->size());
+      return PutBase64(*object.data(), out);
     case Type::kString:
-      return *object.string();
+      return PutJson(*object.string(), out);
     case Type::kUuid: {
       const vtr::XpcUuid uuid = *object.uuidValue();
-      return Base64(uuid.data(), uuid.size());
+      return PutBase64(uuid, out);
     }
     case Type::kArray: {
-      Json array = Json::array();
-      for (const vtr::XpcObject& item : *object.array()) array.push_back(ToJson(item));
-      return array;
+      const char* separator = "";
+      std::fputc('[', out);
+      for (const vtr::XpcObject& item : *object.array()) {
+        std::fputs(std::exchange(separator, ","), out);
+        PutJson(item, out);
+      }
+      std::fputc(']', out);
+      return;
     }
     case Type::kDictionary: {
-      Json dict = Json::object();
-      for (const auto& [key, item] : *object.dictionary()) dict[key] = ToJson(item);
-      return dict;
+      std::vector<const vtr::XpcDictionary::Entry*> entries;
+      entries.reserve(object.dictionary()->size());
+      for (const vtr::XpcDictionary::Entry& entry : *object.dictionary()) entries.push_back(&entry);
+      std::sort(entries.begin(), entries.end(), [](const auto* a, const auto* b) { return a->first < b->first; });
+      const char* separator = "";
+      std::fputc('{', out);
+      for (const vtr::XpcDictionary::Entry* entry : entries) {
+        std::fputs(std::exchange(separator, ","), out);
+        PutJson(entry->first, out);
+        std::fputc(':', out);
+        PutJson(entry->second, out);
+      }
+      std::fputc('}', out);
+      return;
     }
   }
-  return nullptr;
+}
+
+// Where WriteJsonTo puts the text: into text (capacity bytes), or, while
+// text is null, nowhere (it only counts).
+struct JsonSink {
+  char* text = nullptr;
+  size_t capacity = 0;
+  size_t length = 0;
+};
+
+ssize_t WriteToSink(void* cookie, const char* bytes, size_t size) {
+  auto* sink = static_cast<JsonSink*>(cookie);
+  if (sink->text != nullptr) {
+    if (size > sink->capacity - sink->length) return 0;  // an error for stdio
+    std::memcpy(sink->text + sink->length, bytes, size);
+  }
+  sink->length += size;
+  return static_cast<ssize_t>(size);
+}
+
+// Writes object as JSON into sink; false when a write failed.
+bool WriteJsonTo(const vtr::XpcObject& object, JsonSink* sink) {
+  FILE* out = ::fopencookie(sink, "w", cookie_io_functions_t{nullptr, WriteToSink, nullptr, nullptr});
+  if (out == nullptr) return false;
+  try {
+    PutJson(object, out);
+  } catch (...) {
+    std::fclose(out);
+    throw;
+  }
+  const bool written = std::ferror(out) == 0;
+  return std::fclose(out) == 0 && written;
 }
 
 std::optional<vtr::XpcObject> FromJson(const Json& json, int depth) {
@@ -146,6 +220,8 @@ int StatusOfReceiveError(int code) {
       return VITD_ERROR_TIMEOUT;
     case EPROTO:
       return VITD_ERROR_PROTOCOL;
+    case EMSGSIZE:
+      return VITD_ERROR_TOO_LARGE;
     case ENOMEM:
       return VITD_ERROR_NO_MEMORY;
     default:
@@ -213,6 +289,9 @@ const char* vitd_strerror(int status) {
       return "stopped by the message callback";
     case VITD_ERROR_BAD_JSON:
       return "not JSON (or nested deeper than 64 levels)";
+    case VITD_ERROR_TOO_LARGE:
+      return "the helper sent a message larger than 16 MiB or one that would take more than four times its size to "
+             "decode";
     default:
       return "unknown status";
   }
@@ -313,8 +392,19 @@ char* vitd_value_to_json(const vitd_value* value) {
   if (value == nullptr) return nullptr;
   return Guarded(
       [&]() -> char* {
-        const std::string text = ToJson(value->built()).dump(-1, ' ', false, Json::error_handler_t::replace);
-        return ::strdup(text.c_str());
+        // Measured first, then written into a buffer of that size: a text
+        // grown as it is written would hold two copies of itself at times.
+        const vtr::XpcObject object = value->built();
+        JsonSink measure;
+        if (!WriteJsonTo(object, &measure)) return nullptr;
+        JsonSink sink{static_cast<char*>(std::malloc(measure.length + 1)), measure.length + 1, 0};
+        if (sink.text == nullptr) return nullptr;
+        if (!WriteJsonTo(object, &sink) || sink.length != measure.length) {
+          std::free(sink.text);
+          return nullptr;
+        }
+        sink.text[sink.length] = '\0';
+        return sink.text;
       },
       nullptr);
 }

@@ -54,8 +54,20 @@ typedef enum vitd_status {
   VITD_ERROR_PROTOCOL = -6,         /* the helper sent a frame that breaks the protocol; the client is spent */
   VITD_ERROR_NO_MEMORY = -7,
   VITD_ERROR_STOPPED = -8,          /* the message callback asked to stop */
-  VITD_ERROR_BAD_JSON = -9          /* text given to vitd_value_from_json is not JSON */
+  VITD_ERROR_BAD_JSON = -9,         /* text given to vitd_value_from_json is not JSON */
+  VITD_ERROR_TOO_LARGE = -10        /* the helper sent a frame over the limits below; the client is spent */
 } vitd_status;
+
+/* The limits on what a client receives, the same the helper keeps for what
+ * it receives: a frame body holds at most VITD_MAX_FRAME_BYTES, and a frame
+ * is decoded only when its objects take at most VITD_MAX_DECODE_FACTOR times
+ * its size in memory (a floor of 64 KiB for small frames). The library sums
+ * that cost while the bytes arrive, before it builds a single object, so
+ * whatever a peer sends, receiving one message costs the client at most the
+ * frame plus that multiple of it; a frame over either limit ends the call
+ * with VITD_ERROR_TOO_LARGE. */
+#define VITD_MAX_FRAME_BYTES (16u << 20)
+#define VITD_MAX_DECODE_FACTOR 4
 
 /* A sentence describing status (a static string; never NULL). */
 const char *vitd_strerror(int status);

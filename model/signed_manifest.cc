@@ -42,6 +42,15 @@ Value Small(const PlistNode& node) {
   return value.ok() ? std::move(*value) : Value();
 }
 
+// The trust policy of folder; each anchor passed over, and a folder refused,
+// is one line of its own under function's name.
+Result<TrustPolicy> CreatePolicy(const std::string& folder, int rootFd, const char* function) {
+  std::vector<std::string> refusals;
+  Result<TrustPolicy> policy = TrustPolicy::Create(folder, rootFd, &refusals);
+  for (const std::string& refusal : refusals) VTRLogError("%s: %s.", function, refusal);
+  return policy;
+}
+
 }  // namespace
 
 std::optional<VTRSignedManifest> VTRSignedManifest::signedManifestWithBytes(std::string bytes,
@@ -165,7 +174,7 @@ std::optional<std::span<const uint8_t>> VTRSignedManifest::verifyManifestSignatu
 }
 
 PublicKey VTRSignedManifest::createPublicKeyForStrongSigning(const Value& certificates, const SigningAnchors& anchors) {
-  Result<TrustPolicy> policy = TrustPolicy::Create(anchors.production, anchors.rootFd);
+  Result<TrustPolicy> policy = CreatePolicy(anchors.production, anchors.rootFd, kStrong);
   if (!policy.ok()) {
     VTRLogError("%s: Cannot create policy.", kStrong);
     return nullptr;
@@ -182,7 +191,7 @@ PublicKey VTRSignedManifest::createPublicKeyForDevelopmentSigning(const Value& c
 
 PublicKey VTRSignedManifest::createPublicKeyForDevelopmentSigningStandard(const Value& certificates,
                                                                           const SigningAnchors& anchors) {
-  Result<TrustPolicy> policy = TrustPolicy::Create(anchors.test, anchors.rootFd);
+  Result<TrustPolicy> policy = CreatePolicy(anchors.test, anchors.rootFd, kDevelopmentStandard);
   if (!policy.ok()) {
     VTRLogError("%s: Cannot create policy.", kDevelopmentStandard);
     return nullptr;

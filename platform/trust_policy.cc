@@ -1,6 +1,6 @@
 #include "platform/trust_policy.h"
 
-#include <fcntl.h>
+#include <openssl/bio.h>
 #include <openssl/err.h>
 #include <openssl/evp.h>
 #include <openssl/pem.h>
@@ -8,13 +8,9 @@
 #include <openssl/x509.h>
 #include <openssl/x509v3.h>
 
-#include <algorithm>
-#include <cstdio>
-#include <unistd.h>
+#include <utility>
 
-#include "platform/file_tree.h"
-#include "platform/format.h"
-#include "platform/unique_fd.h"
+#include "platform/anchor_folder.h"
 
 namespace vtr {
 namespace {
@@ -51,21 +47,16 @@ Certificate FromDer(const Bytes& der) {
   return certificate;
 }
 
-// Adds every certificate of the PEM file name in dir to store; how many.
-int AddPemFile(X509_STORE* store, int dir, const std::string& name) {
-  const int fd = ::openat(dir, name.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC);
-  FILE* file = fd >= 0 ? ::fdopen(fd, "r") : nullptr;
-  if (file == nullptr) {
-    if (fd >= 0) ::close(fd);
-    return 0;
-  }
+// Adds every certificate of the PEM text to store; how many.
+int AddPemCertificates(X509_STORE* store, const std::string& pem) {
+  std::unique_ptr<BIO, decltype(&BIO_free)> bio(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())), BIO_free);
+  if (!bio) return 0;
   int added = 0;
-  while (X509* certificate = PEM_read_X509(file, nullptr, nullptr, nullptr)) {
+  while (X509* certificate = PEM_read_bio_X509(bio.get(), nullptr, nullptr, nullptr)) {
     if (X509_STORE_add_cert(store, certificate) == 1) ++added;
     X509_free(certificate);
   }
-  ERR_clear_error();  // the end of the file reads as an error
-  std::fclose(file);
+  ERR_clear_error();  // the end of the text reads as an error
   return added;
 }
 
@@ -73,19 +64,21 @@ int AddPemFile(X509_STORE* store, int dir, const std::string& name) {
 
 void PublicKeyFree::operator()(evp_pkey_st* key) const { EVP_PKEY_free(key); }
 
-Result<TrustPolicy> TrustPolicy::Create(const std::string& folder, int rootFd) {
-  const std::string relative = rootFd == AT_FDCWD ? folder : folder.substr(folder.find_first_not_of('/'));
-  UniqueFd dir(::openat(rootFd, relative.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (!dir) return Error::FromErrno(folder);
-  Result<std::vector<std::string>> names = DirectoryEntryNames(dir.get(), folder);
-  if (!names.ok()) return names.error();
-  std::sort(names->begin(), names->end());
+Result<TrustPolicy> TrustPolicy::Create(const std::string& folder, int rootFd, std::vector<std::string>* refusals) {
+  Result<AnchorFolder> anchorFolder = ReadAnchorFolder(folder, rootFd);
+  if (!anchorFolder.ok()) {
+    if (refusals != nullptr && anchorFolder.error().code() == EPERM) refusals->push_back(anchorFolder.error().message());
+    return anchorFolder.error();
+  }
+  if (refusals != nullptr) *refusals = std::move(anchorFolder->passedOver);
   X509_STORE* store = X509_STORE_new();
   if (store == nullptr) return Error(ENOMEM, "X509_STORE_new");
   TrustPolicy policy(store);
   int anchors = 0;
-  for (const std::string& name : *names) {
-    if (name.size() > 4 && name.compare(name.size() - 4, 4, ".pem") == 0) anchors += AddPemFile(store, dir.get(), name);
+  for (const AnchorFile& file : anchorFolder->files) {
+    const int added = AddPemCertificates(store, file.bytes);
+    if (added == 0 && refusals != nullptr) refusals->push_back(file.path + " is passed over: no PEM certificate");
+    anchors += added;
   }
   if (anchors == 0) return Error(ENOENT, folder + " holds no certificate");
   return policy;

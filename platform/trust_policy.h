@@ -2,7 +2,8 @@
 // trusted roots, and the signer's public key when it does, with OpenSSL.
 //
 // A policy is the set of PEM certificates in one anchors folder (every
-// *.pem file there is a trusted root; no hashed names needed), read anew
+// *.pem file there that root put there and closed to others is a trusted
+// root, see anchor_folder.h; no hashed names needed), read anew
 // each time a policy is made, so an operator's change takes effect on the
 // next verification. Intermediates come only from the chain being
 // evaluated. Chains signed with SHA-1 verify: the security level that
@@ -54,9 +55,13 @@ struct TrustEvaluation {
 class TrustPolicy {
  public:
   // The policy of the PEM certificates in folder, an absolute path resolved
-  // beneath rootFd (AT_FDCWD: as it stands). An Error when the folder is
-  // missing or holds no certificate: the policy cannot be created.
-  static Result<TrustPolicy> Create(const std::string& folder, int rootFd = AT_FDCWD);
+  // beneath rootFd (AT_FDCWD: from "/"), read as ReadAnchorFolder reads it.
+  // An Error when the folder is missing, refused (not closed to others) or
+  // holds no usable certificate: the policy cannot be created. refusals, when
+  // given, receives one line for each anchor passed over and for a refused
+  // folder, naming it and why, for the caller to log.
+  static Result<TrustPolicy> Create(const std::string& folder, int rootFd = AT_FDCWD,
+                                    std::vector<std::string>* refusals = nullptr);
 
   TrustPolicy(TrustPolicy&&) noexcept;
   TrustPolicy& operator=(TrustPolicy&&) noexcept;

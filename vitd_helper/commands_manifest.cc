@@ -30,15 +30,23 @@ bool VTRHMessageResponder::createHardLink(const Value& parameter) {
 
 bool VTRHMessageResponder::restoreAttributes(const Value& parameter) {
   VTRLog("Entering %s with parameter: %@", "-[VTRHMessageResponder restoreAttributes:]", parameter);
-  // A missing type or identifier (or one that is no string) is nil: the
-  // whole device.
-  const auto optionalString = [&parameter](std::string_view key) -> std::optional<std::string> {
-    const std::string* s = parameter.get(key).string();
+  // A missing type or identifier (a null is never carried over) is nil: the
+  // whole device. Container types are compared as strings, so one that is
+  // present but no string names no container, and neither does such an
+  // identifier: the request fails rather than reach the whole device.
+  const Value type = parameter.get("ContentType");
+  const Value identifier = parameter.get("Identifier");
+  if (!type.isNil() && !identifier.isNil() && (type.string() == nullptr || identifier.string() == nullptr)) {
+    VTRLogError("Couldn't load manifest dict for %@/%@", type, identifier);
+    return false;
+  }
+  const auto optionalString = [](const Value& value) -> std::optional<std::string> {
+    const std::string* s = value.string();
     return s ? std::optional<std::string>(*s) : std::nullopt;
   };
   return VTRHOperations::sharedInstance().restoreAttributesUnder(
-      StringEntry(parameter, "StagingRootPath"), StringEntry(parameter, "ManifestPath"), optionalString("ContentType"),
-      optionalString("Identifier"));
+      StringEntry(parameter, "StagingRootPath"), StringEntry(parameter, "ManifestPath"), optionalString(type),
+      optionalString(identifier));
 }
 
 bool VTRHMessageResponder::moveStagingToFinal(const Value& parameter) {

@@ -8,6 +8,7 @@
 #include <span>
 
 #include "platform/format.h"
+#include "xpc/message_validator.h"
 #include "xpc/socket_io.h"
 #include "xpc/wire_codec.h"
 
@@ -39,13 +40,22 @@ Status XpcClient::send(const XpcObject& message, std::chrono::milliseconds timeo
 }
 
 Result<XpcObject> XpcClient::receive(std::chrono::milliseconds timeout) {
+  if (spent_) return *spent_;
+  Result<XpcObject> message = receiveFrame(timeout);
+  if (!message.ok() && (message.error().code() == EPROTO || message.error().code() == EMSGSIZE)) {
+    spent_ = message.error();
+  }
+  return message;
+}
+
+Result<XpcObject> XpcClient::receiveFrame(std::chrono::milliseconds timeout) {
   auto deadline = std::chrono::steady_clock::now() + timeout;
   uint8_t buffer[64 * 1024];
   for (;;) {
     // Feed what is left over from earlier reads before reading more.
     while (pendingUsed_ < pending_.size() && !assembler_.frameComplete()) {
       Result<size_t> used = assembler_.consume(std::span(pending_).subspan(pendingUsed_));
-      if (!used) return Error(EPROTO, used.error().message());
+      if (!used) return Error(used.error().code() == EMSGSIZE ? EMSGSIZE : EPROTO, used.error().message());
       pendingUsed_ += *used;
     }
     if (pendingUsed_ == pending_.size()) {
@@ -53,7 +63,13 @@ Result<XpcObject> XpcClient::receive(std::chrono::milliseconds timeout) {
       pendingUsed_ = 0;
     }
     if (assembler_.frameComplete()) {
+      // What the validator summed while the bytes came in, checked before a
+      // single object is built.
+      const uint64_t cost = assembler_.decodeCost();
       XpcBytes body = assembler_.takeFrame();
+      if (cost > MaxDecodeCost(static_cast<uint32_t>(body.size()))) {
+        return Error(EMSGSIZE, "a message whose objects would take more than four times its size");
+      }
       Result<XpcObject> message = DecodeMessage(body);
       if (!message) return Error(EPROTO, message.error().message());
       return message;

@@ -6,6 +6,7 @@
 #define VTR_XPC_CLIENT_H_
 
 #include <chrono>
+#include <optional>
 #include <string>
 
 #include "platform/result.h"
@@ -32,18 +33,26 @@ class XpcClient {
 
   // The next message, waiting at most timeout for it. An Error with
   // ETIMEDOUT when none came in time (the client stays usable), with
-  // ECONNRESET when the helper closed the connection, and with EPROTO for a
-  // frame that breaks the protocol (the client is then spent).
+  // ECONNRESET when the helper closed the connection, with EPROTO for a
+  // frame that breaks the protocol, and with EMSGSIZE for a frame over
+  // kMaxFrameBodyBytes or one whose objects would take more than
+  // MaxDecodeCost (four times its size): such a frame is never decoded, so
+  // whatever the peer sends, a message costs at most that. After EPROTO or
+  // EMSGSIZE the client is spent: every later receive gives the same Error.
   Result<XpcObject> receive(std::chrono::milliseconds timeout);
 
   int fd() const { return socket_.get(); }
 
  private:
+  Result<XpcObject> receiveFrame(std::chrono::milliseconds timeout);
+
   UniqueFd socket_;
   FrameAssembler assembler_;
   // Bytes read but not yet fed to the assembler: pending_ from pendingUsed_.
   XpcBytes pending_;
   size_t pendingUsed_ = 0;
+  // Why the stream cannot be read on: the first protocol or size error.
+  std::optional<Error> spent_;
 };
 
 }  // namespace vtr

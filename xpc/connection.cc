@@ -9,6 +9,11 @@
 #include "xpc/wire_codec.h"
 
 namespace vtr {
+namespace {
+
+constexpr char kStoppedReading[] = "dropped: it stopped reading";
+
+}  // namespace
 
 Connection::Connection(Listener* owner, uint64_t token, UniqueFd socket, PeerIdentity peer, bool trusted,
                        std::chrono::milliseconds sendTimeout)
@@ -29,13 +34,20 @@ Status Connection::send(const XpcObject& message) {
   }
   if (outgoingSent_ == outgoing_.size()) lastProgress_ = Clock::now();
   outgoing_.insert(outgoing_.end(), frame->begin(), frame->end());
-  flush();
-  if (!valid()) return Error(ENOTCONN, invalidReason_);
-  if (std::optional<Clock::time_point> deadline = sendDeadline(); deadline && Clock::now() > *deadline) {
-    close("dropped: it stopped reading");
-    return Error(ETIMEDOUT, "the peer stopped reading");
+  flushOrDropStalled();
+  if (!valid()) {
+    return invalidReason_ == kStoppedReading ? Error(ETIMEDOUT, "the peer stopped reading")
+                                             : Error(ENOTCONN, invalidReason_);
   }
   return Status::Ok();
+}
+
+void Connection::flushOrDropStalled() {
+  flush();
+  if (!valid()) return;
+  if (std::optional<Clock::time_point> deadline = sendDeadline(); deadline && Clock::now() >= *deadline) {
+    close(kStoppedReading);
+  }
 }
 
 void Connection::flush() {

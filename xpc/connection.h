@@ -103,9 +103,17 @@ class Connection : public MessagePeer, public std::enable_shared_from_this<Conne
   void detach();
   // Writes what the queue holds, as far as the socket takes it now.
   void flush();
+  // Flushes, then drops the connection ("stopped reading") when its output
+  // has still not moved for the send timeout. A stall is judged only on what
+  // a write attempted now achieves: while a long command held the loop, a
+  // peer that kept reading made room that no write has used yet, and the
+  // time the queue waited for the loop is not the peer's.
+  void flushOrDropStalled();
   // The socket can take more: flush, and stop asking once the queue is empty.
   void writeReady();
-  // When a stalled queue must have moved, or nullopt when nothing waits.
+  // When a waiting queue must have moved (the send timeout after the last
+  // write that made progress, or after it began to wait), or nullopt when
+  // nothing waits.
   std::optional<Clock::time_point> sendDeadline() const;
   // Tells the owner how the bytes held for the frame in progress changed.
   void reportBuffered();

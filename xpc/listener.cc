@@ -409,7 +409,7 @@ void Listener::housekeeping() {
       stalled.push_back(connection);
     }
   }
-  for (const std::shared_ptr<Connection>& connection : stalled) connection->close("dropped: it stopped reading");
+  for (const std::shared_ptr<Connection>& connection : stalled) connection->flushOrDropStalled();
   armHousekeeping();
 }
 

@@ -21,7 +21,10 @@
 // - the bytes held for frames in progress, over all connections, stay under
 //   partialFrameBudget: past it the connection holding the largest partial
 //   frame is dropped (a request of ordinary size then still gets through);
-// - a client whose output makes no progress for sendTimeout is dropped.
+// - a client whose output makes no progress for sendTimeout is dropped; a
+//   connection whose deadline passed is flushed first and dropped only if
+//   that write still moves nothing (the loop may have been held by a long
+//   command while the client kept reading).
 //
 // Listener events: a new connection; termination imminent (SIGTERM, read
 // through a signalfd: since requests run inside handlers, a SIGTERM that

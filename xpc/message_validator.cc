@@ -21,11 +21,8 @@ constexpr uint64_t kObjectCost = sizeof(XpcObject);
 // A dictionary entry's key (a std::string in a pair), counted twice since
 // building a dictionary sorts a copy of its entries.
 constexpr uint64_t kEntryCost = 2 * (sizeof(XpcDictionary::Entry) - sizeof(XpcObject));
-constexpr uint64_t kMinDecodeCostAllowed = 64 * 1024;
 
 }  // namespace
-
-uint64_t MaxDecodeCost(uint32_t bodyLength) { return std::max<uint64_t>(uint64_t{bodyLength} * 4, kMinDecodeCostAllowed); }
 
 void MessageValidator::start(uint32_t bodyLength) {
   *this = MessageValidator();

@@ -16,6 +16,7 @@
 #ifndef VTR_XPC_MESSAGE_VALIDATOR_H_
 #define VTR_XPC_MESSAGE_VALIDATOR_H_
 
+#include <algorithm>
 #include <array>
 #include <cstddef>
 #include <cstdint>
@@ -75,9 +76,14 @@ class MessageValidator {
   uint64_t cost_ = 0;
 };
 
-// Largest decodeCost the helper decodes for a body of bodyLength bytes: four
-// times the body, and at least a small floor that any ordinary request fits.
-uint64_t MaxDecodeCost(uint32_t bodyLength);
+// Largest decodeCost decoded for a body of bodyLength bytes, by the helper
+// and by its clients alike: four times the body, and at least a small floor
+// that any ordinary message fits.
+inline constexpr uint64_t kDecodeCostFactor = 4;
+inline constexpr uint64_t kMinDecodeCostAllowed = 64 * 1024;
+constexpr uint64_t MaxDecodeCost(uint32_t bodyLength) {
+  return std::max<uint64_t>(uint64_t{bodyLength} * kDecodeCostFactor, kMinDecodeCostAllowed);
+}
 
 }  // namespace vtr
 

@@ -311,7 +311,7 @@ Result<uint32_t> DecodeFrameLength(std::span<const uint8_t, kFrameHeaderBytes> h
   uint32_t length = LoadU32(header.data());
   if (length == 0) return Error::Invalid("frame length 0");
   if (length > kMaxFrameBodyBytes) {
-    return Error::Invalid(Format("frame length %u exceeds the limit of %u", length, kMaxFrameBodyBytes));
+    return Error(EMSGSIZE, Format("frame length %u exceeds the limit of %u", length, kMaxFrameBodyBytes));
   }
   return length;
 }

@@ -33,7 +33,7 @@ inline constexpr uint32_t kMaxFrameBodyBytes = 16u << 20;
 inline constexpr int kMaxMessageDepth = 64;
 
 // The body length a frame header announces, or an Error when it is 0 or
-// larger than kMaxFrameBodyBytes.
+// larger than kMaxFrameBodyBytes (code EMSGSIZE).
 Result<uint32_t> DecodeFrameLength(std::span<const uint8_t, kFrameHeaderBytes> header);
 
 // The message held by a frame body. An Error (a protocol error, its message

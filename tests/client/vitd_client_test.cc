@@ -8,12 +8,15 @@
 #include <unistd.h>
 
 #include <cstdlib>
+#include <cstring>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "platform/unique_fd.h"
 #include "tests/support/test_support.h"
 #include "xpc/client.h"
+#include "xpc/socket_io.h"
 #include "xpc/wire_codec.h"
 
 namespace vtr {
@@ -39,6 +42,11 @@ class VitdClientTest : public ::testing::Test {
     path_.copy(address.sun_path, path_.size());
     ASSERT_EQ(::bind(listener_.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
     ASSERT_EQ(::listen(listener_.get(), 4), 0);
+    Connect();
+  }
+  // A new client and the helper's end of it.
+  void Connect() {
+    vitd_disconnect(client_);
     ASSERT_EQ(vitd_connect(path_.c_str(), &client_), VITD_OK);
     helper_.emplace(UniqueFd(::accept4(listener_.get(), nullptr, nullptr, SOCK_CLOEXEC)));
     ASSERT_GE(helper_->fd(), 0);
@@ -49,6 +57,13 @@ class VitdClientTest : public ::testing::Test {
   void HelperSends(const XpcObject& message) { ASSERT_TRUE(helper_->send(message).ok()); }
   void HelperSendsBytes(const std::vector<uint8_t>& bytes) {
     ASSERT_EQ(::write(helper_->fd(), bytes.data(), bytes.size()), static_cast<ssize_t>(bytes.size()));
+  }
+  // Sends bytes from another thread while the client receives; its status.
+  int ReceiveWhileHelperSends(const std::vector<uint8_t>& bytes) {
+    std::thread writer([&] { EXPECT_TRUE(SendAll(helper_->fd(), bytes, std::chrono::seconds(10)).ok()); });
+    const int status = vitd_receive(client_, nullptr, nullptr);
+    writer.join();
+    return status;
   }
   XpcObject HelperReceives() {
     Result<XpcObject> message = helper_->receive(std::chrono::seconds(2));
@@ -140,6 +155,45 @@ TEST_F(VitdClientTest, TheHelperClosingBeforeTheResponseIsToldAndASendAfterItFai
   EXPECT_EQ(seen.lines, std::vector<std::string>{"progress 5"});
   EXPECT_EQ(response, -1);
   EXPECT_EQ(vitd_send(client_, "quitHelper", nullptr), VITD_ERROR_SEND);
+}
+
+// A whole 16 MiB frame {"x": [object, object, ...]} of copies of one encoded object.
+std::vector<uint8_t> FrameOfMany(const std::vector<uint8_t>& object) {
+  const uint8_t head[] = {0x0A, 1, 0, 0, 0, 1, 0, 0, 0, 'x', 0x09};
+  const uint32_t count = static_cast<uint32_t>((kMaxFrameBodyBytes - sizeof head - 4) / object.size());
+  const uint32_t body = static_cast<uint32_t>(sizeof head + 4 + size_t{count} * object.size());
+  std::vector<uint8_t> frame(4 + size_t{body});
+  std::memcpy(frame.data(), &body, 4);  // little-endian, as the machine
+  std::memcpy(frame.data() + 4, head, sizeof head);
+  std::memcpy(frame.data() + 4 + sizeof head, &count, 4);
+  for (size_t at = 8 + sizeof head; at < frame.size(); at += object.size()) {
+    std::memcpy(frame.data() + at, object.data(), object.size());
+  }
+  return frame;
+}
+
+TEST_F(VitdClientTest, AFrameOverTheLimitsIsNeverDecodedAndSpendsTheClient) {
+  const struct {
+    const char* name;
+    std::vector<uint8_t> frame;
+    int status;
+  } cases[] = {
+      // Each object costs far more than four times its bytes to build.
+      {"nulls", FrameOfMany({0x00}), VITD_ERROR_TOO_LARGE},
+      {"empty dictionaries", FrameOfMany({0x0A, 0, 0, 0, 0}), VITD_ERROR_TOO_LARGE},
+      {"one-byte strings", FrameOfMany({0x07, 1, 0, 0, 0, 'a'}), VITD_ERROR_TOO_LARGE},
+      {"a length over 16 MiB", {1, 0, 0, 1, 0x0A}, VITD_ERROR_TOO_LARGE},
+      // Dense but within the bound: decoded.
+      {"integers", FrameOfMany({0x02, 1, 2, 3, 4, 5, 6, 7, 8}), VITD_OK},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
+    Connect();
+    EXPECT_EQ(ReceiveWhileHelperSends(c.frame), c.status);
+    if (c.status == VITD_OK) continue;
+    HelperSends(XpcObject::Dictionary({{"Response", XpcObject::Bool(true)}}));
+    EXPECT_EQ(vitd_receive(client_, nullptr, nullptr), c.status);
+  }
 }
 
 TEST(VitdClient, ConnectingWhereNothingListensAndBadArgumentsAreErrors) {

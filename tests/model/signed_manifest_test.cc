@@ -21,10 +21,13 @@
 namespace vtr {
 namespace {
 
+using testing::IsRoot;
 using testing::LogCapture;
 using testing::TestPki;
 using testing::TempDir;
 using testing::WriteFile;
+
+constexpr char kStrongFunction[] = "-[VTRSignedManifest createPublicKeyForStrongSigning:]";
 
 class SignedManifestTest : public ::testing::Test {
  protected:
@@ -197,7 +200,50 @@ TEST_F(SignedManifestTest, DevelopmentSigningOnlyOnHardwareThatSaysItIsNotFused)
   anchors_.production = Pki("missing");
   LogCapture log;
   EXPECT_FALSE(Read(ProductionSigned(Payload())));
-  EXPECT_TRUE(log.contains("-[VTRSignedManifest createPublicKeyForStrongSigning:]: Cannot create policy."));
+  EXPECT_TRUE(log.contains(std::string(kStrongFunction) + ": Cannot create policy."));
+}
+
+TEST_F(SignedManifestTest, OnlyRootOwnedAnchorsClosedToOthersAndReachedWithoutALinkCount) {
+  if (!IsRoot()) GTEST_SKIP() << "needs root to own anchors";
+  // A rogue root (the test root) planted next to the genuine one; a manifest
+  // signed under it alone is trusted only where the rogue entry counts.
+  const Bytes rogueSigned = Signed(Payload(), {Pki("test-signer.der")}, Pki("test-signer.key"));
+  const std::string rogue = Pki("test/test-root.pem");
+  const std::string copy = "cp '" + rogue + "' ";
+  const struct {
+    std::string plant;  // shell command; $A is the rogue entry's path
+    const char* why;    // empty: the entry counts
+  } cases[] = {
+      {"ln -s '" + rogue + "' $A", "a symbolic link"},
+      {copy + "$A && chown 501 $A", "owned by uid 501, not root"},
+      {copy + "$A && chmod 0666 $A", "writable by group or others (mode 0666)"},
+      {copy + "$A && chmod 0664 $A", "writable by group or others (mode 0664)"},
+      {"mkfifo $A", "not a regular file"},
+      {"mkdir $A", "not a regular file"},
+      {copy + "$A && chmod 0644 $A", ""},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.plant);
+    TempDir folder;
+    const std::string entry = folder / "rogue.pem";
+    ASSERT_EQ(std::system(("cp '" + Pki("production/production-root.pem") + "' '" + folder.path() + "' && A='" +
+                           entry + "' && " + c.plant).c_str()), 0);
+    anchors_.production = folder.path();
+    LogCapture log;
+    EXPECT_EQ(Read(rogueSigned).has_value(), *c.why == '\0');
+    EXPECT_EQ(log.contains(std::string(kStrongFunction) + ": " + entry + " is passed over: " + c.why + "."), *c.why != '\0');
+    EXPECT_TRUE(Read(ProductionSigned(Payload())));
+  }
+  // A folder others may write is no policy at all.
+  TempDir open;
+  ASSERT_EQ(std::system(("cp '" + Pki("production/production-root.pem") + "' '" + open.path() + "' && chmod 0777 '" +
+                         open.path() + "'").c_str()), 0);
+  anchors_.production = open.path();
+  LogCapture log;
+  EXPECT_FALSE(Read(ProductionSigned(Payload())));
+  EXPECT_TRUE(log.contains(std::string(kStrongFunction) + ": " + open.path() +
+                           " is refused: writable by group or others (mode 0777)."));
+  EXPECT_TRUE(log.contains(std::string(kStrongFunction) + ": Cannot create policy."));
 }
 
 TEST_F(SignedManifestTest, AnExpiredSignerIsNotTrusted) {

@@ -42,6 +42,33 @@ TEST(ResponderTest, EntitledRequestsAreAnsweredInKeyOrderUntilAnUnknownKey) {
   EXPECT_FALSE(log.contains("VTRHMessageResponder does not respond to zzz:."));
 }
 
+TEST(ResponderTest, AContainerTypeOrIdentifierThatIsNoStringNamesNoManifest) {
+  auto peer = std::make_shared<FakePeer>(Value::DictionaryOf({{kVitrelldEntitlement, Value::Boolean(true)}}));
+  VTRHMessageResponder::sharedInstance().setConnection(peer);
+  const struct {
+    XpcObject type, identifier;
+    const char* refusal;  // null: the whole device, whose manifest path is then refused
+  } cases[] = {
+      {XpcObject::Int64(5), XpcObject::String("com.example"), "Couldn't load manifest dict for 5/com.example"},
+      {XpcObject::String("AppData"), XpcObject::Int64(5), "Couldn't load manifest dict for AppData/5"},
+      {XpcObject::Null(), XpcObject::Int64(5), nullptr},
+  };
+  for (const auto& c : cases) {
+    LogCapture log;
+    peer->sent.clear();
+    VTRHMessageResponder::sharedInstance().handleXPCMessage(XpcObject::Dictionary(
+        {{"restoreAttributes:", XpcObject::Dictionary({{"ContentType", c.type},
+                                                       {"Identifier", c.identifier},
+                                                       {"ManifestPath", XpcObject::String("relative")},
+                                                       {"StagingRootPath", XpcObject::String("relative")}})}}));
+    EXPECT_EQ(peer->sent, std::vector<XpcObject>{Response(false)});
+    if (c.refusal) {
+      EXPECT_TRUE(log.contains(c.refusal)) << c.refusal;
+    }
+    EXPECT_EQ(log.contains("Refused path relative: not an absolute path"), c.refusal == nullptr);
+  }
+}
+
 TEST(ResponderTest, OnlyABooleanTrueEntitlementIsServed) {
   const struct {
     Value entitlement;

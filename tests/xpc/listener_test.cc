@@ -6,6 +6,7 @@
 #include <algorithm>
 #include <atomic>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -250,6 +251,51 @@ TEST(ListenerTest, ClientsThatStopReadingDelayNobodyAndAreDroppedOnTime) {
   ASSERT_TRUE(server.waitUntil([&](TestServer& s) { return dropped(s) >= 10; }));
   EXPECT_GE(std::chrono::steady_clock::now() - asked, std::chrono::milliseconds(1500));
   EXPECT_TRUE(server.waitUntil([&](TestServer& s) { return dropped(s) == 10; }));
+}
+
+TEST(ListenerTest, AQueueThatWaitedThroughALongCommandIsFlushedBeforeItIsJudged) {
+  // A client reads its large reply normally while another's command holds
+  // the loop past the send timeout; the timer that comes due meanwhile must
+  // not take the queue's wait for the client's.
+  ListenerOptions options;
+  options.sendTimeout = std::chrono::milliseconds(300);
+  constexpr size_t kPart = 32 << 10;
+  const size_t capacity = StreamSocketCapacity(kPart);
+  // Still queued after the socket was filled twice: what the timer sees.
+  const size_t queued = Connection::kMaxQueuedBytes - 2 * kPart;
+  if (2 * capacity >= capacity + queued) GTEST_SKIP() << "a local socket here holds too much unread";
+  TestServer server(options, [&](TestServer&, const std::shared_ptr<Connection>& connection, const XpcObject& message) {
+    if (message.find("flood")) {
+      XpcObject part = XpcObject::Dictionary({{"Data", XpcObject::Data(XpcBytes(kPart))}});
+      for (size_t i = 0; i < (capacity + queued) / kPart; ++i) EXPECT_TRUE(connection->send(part).ok());
+    } else {
+      std::this_thread::sleep_for(std::chrono::milliseconds(800));  // a long command
+    }
+    (void)connection->send(Reply());
+  });
+  Result<XpcClient> reader = XpcClient::Connect(server.path());
+  ASSERT_TRUE(reader.ok());
+  ASSERT_TRUE(reader->send(Ping("flood")).ok());
+  ASSERT_TRUE(server.waitUntil([](TestServer& s) { return s.messages == 1; }));
+  std::thread reading([&] {
+    for (Result<XpcObject> message = reader->receive(kPatience); message.ok(); message = reader->receive(kPatience)) {
+      if (*message == Reply()) return;
+    }
+    ADD_FAILURE() << "the reading client lost its connection";
+  });
+  // The second long command and the send deadline are both due when the
+  // first ends.
+  std::vector<XpcClient> busy;
+  for (int i = 0; i < 2; ++i) {
+    Result<XpcClient> client = XpcClient::Connect(server.path());
+    ASSERT_TRUE(client.ok());
+    busy.push_back(std::move(*client));
+    ASSERT_TRUE(busy.back().send(Ping("long")).ok());
+    std::this_thread::sleep_for(std::chrono::milliseconds(50));
+  }
+  reading.join();
+  EXPECT_TRUE(server.waitUntil([](TestServer& s) { return s.messages == 3; }));
+  EXPECT_FALSE(AnyReasonContains(server, "stopped reading"));
 }
 
 TEST(ListenerTest, ConnectionsOfOneUserAreCappedAndUntrustedOnesExpire) {
