@@ -16,7 +16,7 @@ int RunCreate(const CreateOptions& options, Console& console) {
   // As the helper does for the device manifest: a tree that holds the output
   // does not describe it half written.
   WalkOptions walk = options.walk;
-  walk.skip.push_back((*writer)->temporaryPath());
+  if (!(*writer)->temporaryPath().empty()) walk.skip.push_back((*writer)->temporaryPath());
   if (!RunWalk(walk, (*writer)->handler(), console)) {
     console.print("vtr-manifest: the manifest could not be made; " + options.output + " is left as it was");
     return kExitIoError;
