@@ -27,7 +27,7 @@ std::string RandomHex() {
 }
 
 Status SyncDirectory(int fd, const std::string& pathForErrors) {
-  if (::fsync(fd) != 0) return Error::FromErrno(pathForErrors);
+  if (::fsync(fd) != 0) return Error::FromErrno("fsync " + pathForErrors);
   return Status::Ok();
 }
 
@@ -35,7 +35,7 @@ Status SyncDirectory(int fd, const std::string& pathForErrors) {
 Status RenameWithin(int fromDir, const std::string& from, int toDir, const std::string& to,
                     const std::string& pathForErrors) {
   if (::renameat2(fromDir, from.c_str(), toDir, to.c_str(), RENAME_NOREPLACE) == 0) return Status::Ok();
-  return Error::FromErrno(pathForErrors);
+  return Error::FromErrno("rename " + pathForErrors);
 }
 
 // The name a copied staging folder bears while it is removed.
@@ -163,7 +163,7 @@ Status FinalLocation::copyAcross(int stagingParent, const std::string& stagingNa
   // Every file and folder of the copy reaches the disk before the copy
   // counts as whole.
   const std::string ready = "." + name_ + ".ready";
-  Status made = ::syncfs(parent_.get()) == 0 ? Status::Ok() : Status(Error::FromErrno(incomingPath));
+  Status made = ::syncfs(parent_.get()) == 0 ? Status::Ok() : Status(Error::FromErrno("syncfs " + incomingPath));
   if (made.ok()) made = RenameWithin(parent_.get(), incoming, parent_.get(), ready, incomingPath);
   if (made.ok()) made = SyncDirectory(parent_.get(), parentPath_);
   if (made.ok()) made = moveSourceAside(stagingParent, stagingName, stagingPath);
@@ -223,7 +223,7 @@ Status FinalLocation::putReadyInPlace() {
     if (Status s = writeRecord(placing, std::to_string(incoming.st_ino)); !s.ok()) return s;
     Status exchanged = ::renameat2(parent_.get(), ready.c_str(), parent_.get(), name_.c_str(), RENAME_EXCHANGE) == 0
                            ? Status::Ok()
-                           : Status(Error::FromErrno(path_));
+                           : Status(Error::FromErrno("exchange " + path_));
     // A file system that cannot exchange: the old content is set aside
     // first; the moment between the renames is finished at the next start.
     if (!exchanged.ok() && exchanged.error().code() == EINVAL &&
