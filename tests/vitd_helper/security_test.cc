@@ -33,14 +33,6 @@ XpcObject Request(const std::string& key, XpcObject parameter) {
   return XpcObject::Dictionary({{key, std::move(parameter)}});
 }
 
-// The one "Response" of a request, or nullopt.
-std::optional<bool> Answer(HelperSandbox& sandbox, const std::string& key, XpcObject parameter) {
-  for (const XpcObject& reply : sandbox.request(Request(key, std::move(parameter)), 1)) {
-    if (const XpcObject* response = reply.find("Response")) return response->boolValue();
-  }
-  return std::nullopt;
-}
-
 // A field of /proc/PID/status in kB ("VmHWM", "VmRSS"), or -1.
 long StatusKilobytes(pid_t pid, const std::string& field) {
   std::ifstream status("/proc/" + std::to_string(pid) + "/status");
