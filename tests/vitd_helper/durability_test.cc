@@ -4,11 +4,13 @@
 #include <poll.h>
 #include <signal.h>
 #include <sys/inotify.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <filesystem>
 #include <map>
+#include <memory>
 #include <thread>
 
 #include <gtest/gtest.h>
@@ -79,16 +81,22 @@ class DurabilityTest : public ::testing::Test {
   void SetUp() override {
     if (!IsRoot()) GTEST_SKIP() << "the helper chroots into its sandbox root and the test mounts a tmpfs: needs root";
   }
-  HelperSandbox sandbox_;
-};
+  // The staging folder's file system, another than /private/var's.
+  void mountStagingFileSystem() {
+    ASSERT_TRUE(MakeDirectories(stageFs).ok());
+    other_ = std::make_unique<TmpfsMount>(stageFs, "64m");
+    ASSERT_TRUE(other_->ok()) << "cannot mount a tmpfs here";
+  }
 
-TEST_F(DurabilityTest, AMoveAcrossFileSystemsKilledAnywhereEndsWithTheOldOrTheWholeNewContent) {
+  HelperSandbox sandbox_;
   const std::string var = sandbox_.host("/private/var"), stageFs = var + "/mobile/stage-fs";
   const std::string staging = stageFs + "/VTR_staging", backup = var + "/backup";
   const XpcObject stagingPath = XpcObject::String("/private/var/mobile/stage-fs/VTR_staging");
-  ASSERT_TRUE(MakeDirectories(stageFs).ok());
-  TmpfsMount other(stageFs, "64m");
-  ASSERT_TRUE(other.ok()) << "cannot mount a tmpfs here";
+  std::unique_ptr<TmpfsMount> other_;
+};
+
+TEST_F(DurabilityTest, AMoveAcrossFileSystemsKilledAnywhereEndsWithTheOldOrTheWholeNewContent) {
+  ASSERT_NO_FATAL_FAILURE(mountStagingFileSystem());
   // Killed when an entry of this name appears or goes (in /private/var, on
   // the staging file system or in the staging tree); nullptr: not killed.
   for (const char* seen : {".backup.incoming-", ".backup.ready", ".VTR_staging.moving", "f", ".backup.outgoing",
@@ -121,6 +129,24 @@ TEST_F(DurabilityTest, AMoveAcrossFileSystemsKilledAnywhereEndsWithTheOldOrTheWh
     EXPECT_FALSE(Exists(staging));
     EXPECT_EQ(sandbox_.terminate(), 0);
   }
+}
+
+TEST_F(DurabilityTest, ACopyThatCannotBeSyncedIsNeverPutInPlace) {
+  if (!CanFailSyscalls()) GTEST_SKIP() << "no seccomp filter for this architecture";
+  ASSERT_NO_FATAL_FAILURE(mountStagingFileSystem());
+  MakeTree(backup, "old", 1, 1);
+  MakeTree(staging, "new", 2, 2);
+  const std::string newText = TreeText(staging);
+  sandbox_.failSyscalls({SYS_syncfs}, EIO);
+  ASSERT_TRUE(sandbox_.start()) << sandbox_.log();
+  EXPECT_EQ(Answer(sandbox_, "moveStagingToFinal:", stagingPath), false);
+  EXPECT_EQ(TreeText(staging), newText);
+  EXPECT_FALSE(Exists(backup)) << "the old content is discarded, as a move always does";
+  for (const std::string& name : Names(var)) EXPECT_NE(name.rfind(".backup", 0), 0u) << name;
+  EXPECT_NE(sandbox_.log().find("Could not move /private/var/mobile/stage-fs/VTR_staging to /var/backup with error - "
+                                "syncfs /private/var/.backup.incoming-"),
+            std::string::npos)
+      << sandbox_.log();
 }
 
 TEST_F(DurabilityTest, AManifestKilledMidScanLeavesNothingAndTheOldManifestWhole) {
