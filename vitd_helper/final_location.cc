@@ -84,7 +84,7 @@ std::optional<std::string> FinalLocation::readRecord(const std::string& name) co
 }
 
 void FinalLocation::finishInterruptedMove() {
-  const std::string incoming = "." + name_ + ".incoming-";
+  const std::string incoming = entry(".incoming-");
   if (Result<std::vector<std::string>> names = DirectoryEntryNames(parent_.get(), parentPath_); names.ok()) {
     for (const std::string& name : *names) {
       if (!HasPrefix(name, incoming)) continue;
@@ -92,11 +92,11 @@ void FinalLocation::finishInterruptedMove() {
       removeEntry(name);
     }
   }
-  const std::string ready = "." + name_ + ".ready";
-  const std::string outgoing = "." + name_ + ".outgoing";
+  const std::string ready = entry(".ready");
+  const std::string outgoing = entry(".outgoing");
   // Killed right after the exchange, the replaced content bears the ready
   // name: the record of what was put in place tells them apart.
-  const std::optional<std::string> placing = readRecord("." + name_ + ".placing");
+  const std::optional<std::string> placing = readRecord(entry(".placing"));
   struct stat current;
   if (exists(ready) && placing && StatAt(parent_.get(), name_, &current) &&
       *placing == std::to_string(current.st_ino)) {
@@ -109,12 +109,12 @@ void FinalLocation::finishInterruptedMove() {
       VTRLogError("Could not put %@ in place: %@", AppendPathComponent(parentPath_, ready), placed.error().description());
     }
   }
-  (void)::unlinkat(parent_.get(), ("." + name_ + ".placing").c_str(), 0);
+  (void)::unlinkat(parent_.get(), (entry(".placing")).c_str(), 0);
   if (exists(outgoing)) {
     VTRLog("Removing %@, the content an interrupted move replaced", AppendPathComponent(parentPath_, outgoing));
     removeEntry(outgoing);
   }
-  if (exists("." + name_ + ".source")) {
+  if (exists(entry(".source"))) {
     VTRLog("Removing the staging folder an interrupted move had copied to %@", path_);
     removeMovedSource();
   }
@@ -122,7 +122,7 @@ void FinalLocation::finishInterruptedMove() {
 
 Status FinalLocation::receive(int stagingParent, const std::string& stagingName, const struct stat& staged,
                               const std::string& stagingPath) {
-  const std::string ready = "." + name_ + ".ready";
+  const std::string ready = entry(".ready");
   const std::string readyPath = AppendPathComponent(parentPath_, ready);
   Status renamed = RenameWithin(stagingParent, stagingName, parent_.get(), ready, stagingPath);
   if (!renamed.ok() && renamed.error().code() == EXDEV) {
@@ -143,7 +143,7 @@ Status FinalLocation::receive(int stagingParent, const std::string& stagingName,
 }
 
 Status FinalLocation::copyAcross(int stagingParent, const std::string& stagingName, const std::string& stagingPath) {
-  const std::string incoming = "." + name_ + ".incoming-" + RandomHex();
+  const std::string incoming = entry(".incoming-") + RandomHex();
   const std::string incomingPath = AppendPathComponent(parentPath_, incoming);
   Status copied = CopyItemAt(stagingParent, stagingName, parent_.get(), incoming, stagingPath, incomingPath);
   // Without room beside the old content, the old content goes first: a
@@ -162,7 +162,7 @@ Status FinalLocation::copyAcross(int stagingParent, const std::string& stagingNa
   }
   // Every file and folder of the copy reaches the disk before the copy
   // counts as whole.
-  const std::string ready = "." + name_ + ".ready";
+  const std::string ready = entry(".ready");
   Status made = ::syncfs(parent_.get()) == 0 ? Status::Ok() : Status(Error::FromErrno("syncfs " + incomingPath));
   if (made.ok()) made = RenameWithin(parent_.get(), incoming, parent_.get(), ready, incomingPath);
   if (made.ok()) made = SyncDirectory(parent_.get(), parentPath_);
@@ -180,17 +180,17 @@ Status FinalLocation::moveSourceAside(int stagingParent, const std::string& stag
   const std::string asidePath = AppendPathComponent(SplitLastComponent(stagingPath).parent, aside);
   // Where it goes is recorded first, so that a kill after the rename leaves
   // it to be found and removed at the next start.
-  if (Status recorded = writeRecord("." + name_ + ".source", asidePath); !recorded.ok()) return recorded;
+  if (Status recorded = writeRecord(entry(".source"), asidePath); !recorded.ok()) return recorded;
   // A folder of that name left by an earlier move is a leftover of the same kind.
   (void)RemoveItemAt(stagingParent, aside, asidePath);
   Status moved = RenameWithin(stagingParent, stagingName, stagingParent, aside, stagingPath);
   if (moved.ok()) moved = SyncDirectory(stagingParent, stagingPath);
-  if (!moved.ok()) (void)::unlinkat(parent_.get(), ("." + name_ + ".source").c_str(), 0);
+  if (!moved.ok()) (void)::unlinkat(parent_.get(), (entry(".source")).c_str(), 0);
   return moved;
 }
 
 void FinalLocation::removeMovedSource() {
-  const std::string record = "." + name_ + ".source";
+  const std::string record = entry(".source");
   const std::string recordPath = AppendPathComponent(parentPath_, record);
   const std::string text = readRecord(record).value_or(std::string());
   // Resolved as any client path: the folder it lies in is the client's.
@@ -207,9 +207,9 @@ void FinalLocation::removeMovedSource() {
 }
 
 Status FinalLocation::putReadyInPlace() {
-  const std::string ready = "." + name_ + ".ready";
-  const std::string outgoing = "." + name_ + ".outgoing";
-  const std::string placing = "." + name_ + ".placing";
+  const std::string ready = entry(".ready");
+  const std::string outgoing = entry(".outgoing");
+  const std::string placing = entry(".placing");
   if (exists(outgoing)) removeEntry(outgoing);
   struct stat incoming;
   if (!StatAt(parent_.get(), ready, &incoming)) return Error::FromErrno(AppendPathComponent(parentPath_, ready));
@@ -242,7 +242,7 @@ Status FinalLocation::putReadyInPlace() {
     (void)::unlinkat(parent_.get(), placing.c_str(), 0);
     removeEntry(outgoing);
   }
-  if (exists("." + name_ + ".source")) removeMovedSource();
+  if (exists(entry(".source"))) removeMovedSource();
   return Status::Ok();
 }
 

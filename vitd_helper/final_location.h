@@ -67,6 +67,8 @@ class FinalLocation {
   void discard();
 
  private:
+  // The name of the helper's entry ".NAME" + suffix.
+  std::string entry(const char* suffix) const { return "." + name_ + suffix; }
   bool exists(const std::string& name) const;
   // A small file of the helper's beside the final location: written whole
   // and synced, and read back (nullopt when there is none).
