@@ -116,8 +116,13 @@ TEST_F(DurabilityTest, AMoveAcrossFileSystemsKilledAnywhereEndsWithTheOldOrTheWh
     const std::string now = TreeText(backup);
     EXPECT_TRUE(now == oldText || now == newText) << "a mix or a part stands in place";
 
-    // Restarted, the helper finishes or removes what the kill left.
+    // Restarted, the helper finishes or removes what the kill left, and
+    // says so.
+    std::vector<std::string> left = Names(var);
+    const bool leftovers = Exists(stageFs + "/.VTR_staging.moving") ||
+                           std::any_of(left.begin(), left.end(), [](auto& n) { return n.rfind(".backup", 0) == 0; });
     ASSERT_TRUE(sandbox_.start()) << sandbox_.log();
+    EXPECT_EQ(sandbox_.log().find("an interrupted move") != std::string::npos, leftovers) << sandbox_.log();
     const bool stagingLeft = Exists(staging);
     EXPECT_EQ(Names(stageFs), stagingLeft ? std::vector<std::string>{"VTR_staging"} : std::vector<std::string>{});
     for (const std::string& name : Names(var)) EXPECT_NE(name.rfind(".backup", 0), 0u) << name;
