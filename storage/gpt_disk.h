@@ -84,7 +84,9 @@ Result<std::vector<GptWrite>> PlanGptWrites(uint32_t blockSize, uint64_t blockCo
 // where they say.
 Status WriteGptWithBackup(int fd, uint32_t blockSize, uint64_t blockCount, const GptImage& image);
 
-// What a reader finds checking both copies of a GPT.
+// What a reader finds checking both copies of a GPT. The backup is read at
+// the primary header's alternate LBA, or in the disk's last block when the
+// primary header is not valid (as the kernel and sgdisk look for it).
 struct GptValidity {
   bool primaryHeaderCrc = false;
   bool primaryTableCrc = false;
