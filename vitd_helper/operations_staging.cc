@@ -63,7 +63,12 @@ bool VTRHOperations::moveStagingToFinal(const std::string& stagingPath) {
   FinalLocation location(std::move(*finalParent), final->path, resolver_);
   location.finishInterruptedMove();  // what a move that failed before left
   Status moved = location.receive(parent->get(), staging->name(), staged, staging->path);
-  if (moved.ok()) moved = location.putReadyInPlace();
+  if (moved.ok() && !location.putReadyInPlace().ok()) {
+    // The staging folder is taken already: without the old content (which
+    // goes in any case) the new needs one rename and no record.
+    location.discard();
+    moved = location.putReadyInPlace();
+  }
   if (!moved.ok()) {
     // The old content is discarded whatever happens to the new.
     location.discard();
