@@ -138,8 +138,14 @@ Status FinalLocation::receive(int stagingParent, const std::string& stagingName,
     if (!RenameWithin(parent_.get(), ready, stagingParent, stagingName, readyPath).ok()) removeEntry(ready);
     return Error(EAGAIN, stagingPath + " changed while it was moved");
   }
-  if (Status synced = SyncDirectory(stagingParent, stagingPath); !synced.ok()) return synced;
-  return SyncDirectory(parent_.get(), parentPath_);
+  // The staged files (links the client had made) and both folders reach the
+  // disk before the old content is replaced: one file system, one syncfs.
+  if (::syncfs(parent_.get()) != 0) {
+    Error failed = Error::FromErrno("syncfs " + readyPath);
+    (void)RenameWithin(parent_.get(), ready, stagingParent, stagingName, readyPath);  // back where it was
+    return failed;
+  }
+  return Status::Ok();
 }
 
 Status FinalLocation::copyAcross(int stagingParent, const std::string& stagingName, const std::string& stagingPath) {

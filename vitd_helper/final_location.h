@@ -15,7 +15,7 @@
 //                          (".STAGING.moving" in its own folder) once its
 //                          copy was ready, while it is removed.
 // A staging folder on the final location's file system is renamed to
-// .NAME.ready at once. One on another file system is copied to
+// .NAME.ready at once and the file system synced. One on another file system is copied to
 // .NAME.incoming-XXXXXX, synced (syncfs) and renamed to .NAME.ready; then
 // it is renamed aside on its own file system, so that a retry finds no
 // staging folder, and only then removed. .NAME.ready is put in place by

@@ -136,22 +136,25 @@ TEST_F(DurabilityTest, AMoveAcrossFileSystemsKilledAnywhereEndsWithTheOldOrTheWh
   }
 }
 
-TEST_F(DurabilityTest, ACopyThatCannotBeSyncedIsNeverPutInPlace) {
+TEST_F(DurabilityTest, ContentThatCannotBeSyncedIsNeverPutInPlace) {
   if (!CanFailSyscalls()) GTEST_SKIP() << "no seccomp filter for this architecture";
   ASSERT_NO_FATAL_FAILURE(mountStagingFileSystem());
-  MakeTree(backup, "old", 1, 1);
-  MakeTree(staging, "new", 2, 2);
-  const std::string newText = TreeText(staging);
   sandbox_.failSyscalls({SYS_syncfs}, EIO);
   ASSERT_TRUE(sandbox_.start()) << sandbox_.log();
-  EXPECT_EQ(Answer(sandbox_, "moveStagingToFinal:", stagingPath), false);
-  EXPECT_EQ(TreeText(staging), newText);
-  EXPECT_FALSE(Exists(backup)) << "the old content is discarded, as a move always does";
-  for (const std::string& name : Names(var)) EXPECT_NE(name.rfind(".backup", 0), 0u) << name;
-  EXPECT_NE(sandbox_.log().find("Could not move /private/var/mobile/stage-fs/VTR_staging to /var/backup with error - "
-                                "syncfs /private/var/.backup.incoming-"),
-            std::string::npos)
-      << sandbox_.log();
+  for (const std::string folder : {"/private/var/mobile/stage-fs", "/private/var/mobile"}) {  // another file system, the same
+    SCOPED_TRACE(folder);
+    MakeTree(backup, "old", 1, 1);
+    MakeTree(sandbox_.host(folder + "/VTR_staging"), "new", 2, 2);
+    const std::string newText = TreeText(sandbox_.host(folder + "/VTR_staging"));
+    EXPECT_EQ(Answer(sandbox_, "moveStagingToFinal:", XpcObject::String(folder + "/VTR_staging")), false);
+    EXPECT_EQ(TreeText(sandbox_.host(folder + "/VTR_staging")), newText);
+    EXPECT_FALSE(Exists(backup)) << "the old content is discarded, as a move always does";
+    for (const std::string& name : Names(var)) EXPECT_NE(name.rfind(".backup", 0), 0u) << name;
+    EXPECT_NE(sandbox_.log().find("Could not move " + folder + "/VTR_staging to /var/backup with error - syncfs "
+                                  "/private/var/.backup."),
+              std::string::npos)
+        << sandbox_.log();
+  }
 }
 
 TEST_F(DurabilityTest, AManifestKilledMidScanLeavesNothingAndTheOldManifestWhole) {
