@@ -4,7 +4,8 @@
 // to do.
 //
 // The helper keeps its own entries beside the final location (NAME is its
-// last component, "backup"), in its parent, which clients cannot write:
+// last component, "backup"), in its parent, which the client cannot write
+// itself:
 //   .NAME.incoming-XXXXXX  a copy being made from another file system;
 //   .NAME.ready            new content, whole and synced, to be put in place;
 //   .NAME.placing          a file holding the inode number of the content
@@ -15,8 +16,9 @@
 //                          (".STAGING.moving" in its own folder) once its
 //                          copy was ready, while it is removed.
 // A staging folder on the final location's file system is renamed to
-// .NAME.ready at once and the file system synced. One on another file system is copied to
-// .NAME.incoming-XXXXXX, synced (syncfs) and renamed to .NAME.ready; then
+// .NAME.ready at once and the file system synced. One on another file
+// system is copied to .NAME.incoming-XXXXXX, synced (syncfs) and renamed
+// to .NAME.ready; then
 // it is renamed aside on its own file system, so that a retry finds no
 // staging folder, and only then removed. .NAME.ready is put in place by
 // one exchange of names (RENAME_EXCHANGE) with the old content, so that at
