@@ -79,14 +79,38 @@ void VTRLogModel::writeLine(std::string_view message, LogPriority priority) {
   std::shared_ptr<SystemLog> systemLog;
   {
     std::lock_guard<std::mutex> lock(mutex_);
-    if (logFP_ != nullptr) {
-      const std::string line = Format("%@ %@\n", clock_->now(), message);
-      std::fputs(line.c_str(), logFP_);
-      std::fflush(logFP_);
-    }
+    if (logFP_ != nullptr) appendLine(Format("%@ %@\n", clock_->now(), message));
     systemLog = systemLog_;
   }
   systemLog->write(message, priority);
+}
+
+void VTRLogModel::appendLine(const std::string& line) {
+  const int fd = ::fileno(logFP_);
+  if (fd < 0) {  // a stream without a descriptor (set by a caller): written as a stream
+    std::fputs(line.c_str(), logFP_);
+    std::fflush(logFP_);
+    return;
+  }
+  // One write(2) on the append-mode descriptor: the line lands whole at the
+  // end, or, when the disk fills part way, the part is cut off again, so
+  // that no later line is glued to a fragment. A fragment that cannot be
+  // cut off is closed by the next line, which then begins on a line of its
+  // own.
+  const std::string broken = lineOpen_ ? "\n" + line : std::string();
+  const std::string_view text = lineOpen_ ? std::string_view(broken) : std::string_view(line);
+  struct stat before;
+  const bool sized = ::fstat(fd, &before) == 0;
+  ssize_t written;
+  do {
+    written = ::write(fd, text.data(), text.size());
+  } while (written < 0 && errno == EINTR);
+  if (written < 0) return;  // nothing written (a full disk): nothing to undo
+  if (static_cast<size_t>(written) == text.size()) {
+    lineOpen_ = false;
+    return;
+  }
+  if (!sized || ::ftruncate(fd, before.st_size) != 0) lineOpen_ = true;
 }
 
 bool VTRLogModel::admitPeerLine(uint32_t peer, uint64_t* suppressed) {
@@ -146,6 +170,7 @@ bool VTRLogModel::openDayFile(int folder, const std::string& name, const std::st
   }
   std::lock_guard<std::mutex> lock(mutex_);
   logFP_ = fp;
+  lineOpen_ = false;
   return fp != nullptr;
 }
 
@@ -212,6 +237,7 @@ FILE* VTRLogModel::logFP() const {
 void VTRLogModel::setLogFP(FILE* fp) {
   std::lock_guard<std::mutex> lock(mutex_);
   logFP_ = fp;
+  lineOpen_ = false;
 }
 
 void VTRLogModel::setSystemLog(std::shared_ptr<SystemLog> systemLog) {

@@ -65,8 +65,9 @@ class VTRLogModel {
   }
 
   // Appends "<date description> <message>\n" to the log file when file
-  // logging is on (flushed at once), and sends the message alone to the
-  // system log in every case, with its priority.
+  // logging is on, with one write(2), so the line lands whole or not at all
+  // (a full disk), and sends the message alone to the system log in every
+  // case, with its priority.
   void logMessage(std::string_view message, LogPriority priority = LogPriority::kNotice);
 
   // Opens path for appending (created if missing, never truncated), creating
@@ -110,6 +111,8 @@ class VTRLogModel {
   void systemLogOnly(std::string_view message, LogPriority priority = LogPriority::kError);
   // Writes one line to the file and the system log.
   void writeLine(std::string_view message, LogPriority priority);
+  // Appends line to the file whole or not at all (under the lock).
+  void appendLine(const std::string& line);
   // Whether a line caused by peer may be written now; *suppressed becomes
   // the count of lines held back before it (to be reported first).
   bool admitPeerLine(uint32_t peer, uint64_t* suppressed);
@@ -121,6 +124,8 @@ class VTRLogModel {
 
   mutable std::mutex mutex_;  // the one lock: file writes and flushes, peer budgets
   FILE* logFP_ = nullptr;
+  // The file ends in a fragment of a line that could not be cut off.
+  bool lineOpen_ = false;
   std::unordered_map<uint32_t, PeerBudget> peerBudgets_;
   std::shared_ptr<SystemLog> systemLog_;
   std::shared_ptr<Clock> clock_;

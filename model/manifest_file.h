@@ -3,8 +3,9 @@
 // sits in memory. The file is the dictionary a filled VTRManifest holds, its
 // entries in the order the fill delivered them.
 //
-// The file appears atomically: the entries go to a temporary file beside the
-// target, which replaces the target only on commit(). An object destroyed
+// The file appears atomically: the entries go to a temporary file (nameless
+// while it is written, see AtomicFile), which replaces the target only on
+// commit(). An object destroyed
 // without a successful commit leaves the target as it was. When the file is
 // written inside the tree being walked (as the device manifest is), the walk
 // meets the temporary file; its record is left out, so the manifest holds
@@ -54,9 +55,9 @@ class ManifestFileWriter {
   // untouched). Call at most once.
   Status commit();
 
-  // The temporary file the entries go to until commit(). A fill of a tree
-  // that holds it must skip it, or the manifest would describe itself half
-  // written.
+  // The temporary file the entries go to until commit(), when it has a
+  // name (empty otherwise). A fill of a tree that holds it must skip it, or
+  // the manifest would describe itself half written.
   std::string temporaryPath() const { return file_.temporaryPath(); }
 
  private:

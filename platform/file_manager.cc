@@ -63,18 +63,23 @@ Status MoveItemAt(int srcDir, const std::string& srcName, int dstDir, const std:
   }
   if (errno == EEXIST) return Error::FromErrno(dstPath);
   if (errno != EXDEV) return Error::FromErrno(srcPath);
-  // Across file systems: a copy, made only when it fits (holes take no
-  // room), then the source goes. A copy that fails is removed again and the
-  // source stays as it was.
+  // Across file systems: a copy, then the source goes. A copy that fails is
+  // removed again and the source stays as it was.
+  Status copied = CopyItemAt(srcDir, srcName, dstDir, dstName, srcPath, dstPath);
+  if (!copied.ok()) return copied;
+  return RemoveItemAt(srcDir, srcName, srcPath);
+}
+
+Status CopyItemAt(int srcDir, const std::string& srcName, int dstDir, const std::string& dstName,
+                  const std::string& srcPath, const std::string& dstPath) {
+  // Made only when it fits (holes take no room).
   Result<uint64_t> needed = AllocatedBytesOfTree(srcDir, srcName, srcPath);
   if (!needed.ok()) return needed.error();
   struct statvfs room;
   if (::fstatvfs(dstDir, &room) == 0 && uint64_t{room.f_bavail} * room.f_frsize < *needed) {
     return Error(ENOSPC, Format("%s needs %llu bytes", dstPath.c_str(), static_cast<unsigned long long>(*needed)));
   }
-  Status copied = ReplicateItem(srcDir, srcName, dstDir, dstName, Replication::kCopy, srcPath, dstPath);
-  if (!copied.ok()) return copied;
-  return RemoveItemAt(srcDir, srcName, srcPath);
+  return ReplicateItem(srcDir, srcName, dstDir, dstName, Replication::kCopy, srcPath, dstPath);
 }
 
 Status MoveItem(const std::string& src, const std::string& dst) {

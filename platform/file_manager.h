@@ -149,6 +149,13 @@ Status MoveItem(const std::string& src, const std::string& dst);
 Status MoveItemAt(int srcDir, const std::string& srcName, int dstDir, const std::string& dstName,
                   const std::string& srcPath, const std::string& dstPath);
 
+// The copy MoveItemAt makes across file systems, the source left as it is:
+// holes kept, made only when the destination has room for it (ENOSPC
+// otherwise, before anything is written), removed again when it cannot be
+// finished. Nothing is synced.
+Status CopyItemAt(int srcDir, const std::string& srcName, int dstDir, const std::string& dstName,
+                  const std::string& srcPath, const std::string& dstPath);
+
 // Makes dst a hard link of src, which must not exist (EEXIST otherwise). For
 // a directory, dst is a new directory tree with the source's directories
 // recreated (mode, owner, times, extended attributes), its files hard-linked

@@ -103,7 +103,7 @@ Result<GptImage> ReadGptImage(int fd, uint32_t blockSize) {
   return image;
 }
 
-Status WriteGptWithBackup(int fd, uint32_t blockSize, uint64_t blockCount, const GptImage& image) {
+Result<std::vector<GptWrite>> PlanGptWrites(uint32_t blockSize, uint64_t blockCount, const GptImage& image) {
   const uint64_t lastLba = blockCount - 1;
   const uint32_t count = image.entryCount();
   const uint32_t entrySize = LoadU32(&image.header[kGptEntrySizeOffset]);
@@ -135,17 +135,26 @@ Status WriteGptWithBackup(int fd, uint32_t blockSize, uint64_t blockCount, const
   StoreU64(&backup[kGptEntriesLbaOffset], backupTableLba);
   StoreU32(&backup[kGptHeaderCrcOffset], HeaderCrc(backup));
 
-  // The primary copy as two blocks, header then table.
-  std::vector<uint8_t> blocks(size_t{2} * blockSize, 0);
-  std::copy(primary.begin(), primary.end(), blocks.begin());
-  std::copy(table.begin(), table.end(), blocks.begin() + blockSize);
-  std::vector<uint8_t> backupBlock(blockSize, 0);
-  std::copy(backup.begin(), backup.end(), backupBlock.begin());
+  auto inBlock = [blockSize](const std::vector<uint8_t>& header) {
+    std::vector<uint8_t> block(blockSize, 0);
+    std::copy(header.begin(), header.end(), block.begin());
+    return block;
+  };
+  std::vector<GptWrite> writes;
+  writes.push_back({backupTableLba * blockSize, table, false});
+  writes.push_back({lastLba * blockSize, inBlock(backup), true});
+  writes.push_back({uint64_t{2} * blockSize, table, false});
+  writes.push_back({blockSize, inBlock(primary), true});
+  return writes;
+}
 
-  if (Status s = WriteAt(fd, blocks, blockSize); !s.ok()) return s;
-  if (Status s = WriteAt(fd, table, backupTableLba * blockSize); !s.ok()) return s;
-  if (Status s = WriteAt(fd, backupBlock, lastLba * blockSize); !s.ok()) return s;
-  if (::fsync(fd) != 0) return Error::FromErrno("fsync");
+Status WriteGptWithBackup(int fd, uint32_t blockSize, uint64_t blockCount, const GptImage& image) {
+  Result<std::vector<GptWrite>> writes = PlanGptWrites(blockSize, blockCount, image);
+  if (!writes.ok()) return writes.error();
+  for (const GptWrite& write : *writes) {
+    if (Status s = WriteAt(fd, write.bytes, write.offset); !s.ok()) return s;
+    if (write.flushAfter && ::fsync(fd) != 0) return Error::FromErrno("fsync");
+  }
   return Status::Ok();
 }
 
@@ -179,7 +188,10 @@ Result<GptValidity> CheckGpt(int fd, uint32_t blockSize, uint64_t blockCount) {
   if (!primary.ok()) return primary.error();
   validity.primaryHeaderCrc = primary->headerCrc;
   validity.primaryTableCrc = primary->tableCrc;
-  const uint64_t alternate = LoadU64(&primary->header[kGptAlternateLbaOffset]);
+  // A torn or stale primary header points nowhere reliable: the backup is
+  // then looked for where readers look for it, in the disk's last block.
+  const uint64_t alternate =
+      primary->headerCrc ? LoadU64(&primary->header[kGptAlternateLbaOffset]) : blockCount - 1;
   if (alternate == 0 || alternate >= blockCount) return validity;
   Result<Copy> backup = read(alternate);
   if (!backup.ok()) return backup.error();

@@ -11,6 +11,7 @@
 #include <cstdint>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "platform/result.h"
 #include "storage/gpt_layout.h"
@@ -58,16 +59,34 @@ Result<bool> ReadZarnSignature(int fd, uint32_t blockSize);
 // open as fd; EIO when the two blocks cannot be read whole.
 Result<GptImage> ReadGptImage(int fd, uint32_t blockSize);
 
-// Writes image to the disk open as fd (blockSize bytes a block, blockCount
-// blocks): the header and the table at blocks 1 and 2 with both CRCs
-// recomputed, then the backup table right after the last usable block and
-// the backup header in the last block (the header's alternate LBA), then
-// flushes. Nothing is written when the header's alternate LBA is not the
-// disk's last block or the usable range does not leave room for the backup
-// table (EINVAL).
+// One write of a table update: bytes at a byte offset of the disk, and
+// whether the disk is flushed after it (a write barrier).
+struct GptWrite {
+  uint64_t offset = 0;
+  std::vector<uint8_t> bytes;
+  bool flushAfter = false;
+};
+
+// The writes that put image on a disk of blockCount blocks of blockSize
+// bytes, in the order they must reach it: the header and the table get both
+// CRCs recomputed; the backup copy (table right after the last usable
+// block, header in the last block) is written first and flushed, then the
+// primary (table at block 2, header at block 1) and flushed. Within a copy
+// the table goes before the header whose CRC covers it, so the header is
+// the copy's commit. Readers take the primary copy while it is valid and
+// fall back to the backup: whatever prefix of these writes reaches the disk
+// (a power cut), one copy is whole, the old one or the new. EINVAL when the
+// header's alternate LBA is not the disk's last block or the usable range
+// leaves no room for the backup table.
+Result<std::vector<GptWrite>> PlanGptWrites(uint32_t blockSize, uint64_t blockCount, const GptImage& image);
+
+// Makes PlanGptWrites' writes on the disk open as fd, flushing (fsync)
+// where they say.
 Status WriteGptWithBackup(int fd, uint32_t blockSize, uint64_t blockCount, const GptImage& image);
 
-// What a reader finds checking both copies of a GPT.
+// What a reader finds checking both copies of a GPT. The backup is read at
+// the primary header's alternate LBA, or in the disk's last block when the
+// primary header is not valid (as the kernel and sgdisk look for it).
 struct GptValidity {
   bool primaryHeaderCrc = false;
   bool primaryTableCrc = false;

@@ -107,6 +107,7 @@ int main(int argc, char** argv) {
 
   VTRLog("%s started", argv[0]);
   (void)logModel.enableLogToFilesUnder("/private/var/logs/vitd", "vitd_helper", 5);
+  VTRHOperations::sharedInstance().finishInterruptedWork();
 
   VTRProgressUpdater::sharedInstance().setSender(
       [](int64_t percent) { VTRHMessageResponder::sharedInstance().sendProgress(percent); });

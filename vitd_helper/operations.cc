@@ -65,6 +65,11 @@ std::optional<CheckedPath> VTRHOperations::checkClientPath(const std::string& pa
   return std::move(*checked);
 }
 
+void VTRHOperations::finishInterruptedWork() {
+  finishInterruptedMove();
+  removeUnfinishedManifest();
+}
+
 bool VTRHOperations::migratePreferencesFile() {
   const std::string& name = paths_.preferencesFileName;
   const std::string source = AppendPathComponent(paths_.rootPreferencesFolder, name);

@@ -10,7 +10,7 @@
 //
 // Every method runs synchronously on the caller's thread, returns true on
 // success, and reports a failure by false plus at most one log line; nothing
-// is retried or rolled back. The helper calls it one command at a time.
+// is retried. The helper calls it one command at a time.
 #ifndef VTR_VITD_HELPER_OPERATIONS_H_
 #define VTR_VITD_HELPER_OPERATIONS_H_
 
@@ -75,8 +75,16 @@ class VTRHOperations {
   bool createHardLinks(const std::string& source, const std::string& stagingPath);
 
   // Moves the staging directory (a real directory, no link) to the final
-  // location, replacing what was there.
+  // location, replacing what was there (also when the move fails). The
+  // final location holds the old content whole or the new whole at every
+  // moment, and a kill or power cut never leaves the staging folder in part
+  // with its copy in place (see final_location.h).
   bool moveStagingToFinal(const std::string& stagingPath);
+
+  // At start-up, before serving: finishes what a kill interrupted, a move
+  // to the final location and the device manifest's file; each thing found
+  // is one log line.
+  void finishInterruptedWork();
 
   // Reads and verifies the signed manifest at manifestPath, picks its file
   // manifest (the whole device when containerType or identifier is absent;
@@ -125,6 +133,11 @@ class VTRHOperations {
  private:
   // The checked client path, or nullopt after the refusal is logged.
   std::optional<CheckedPath> checkClientPath(const std::string& path, ClientUse use) const;
+  // The parts of finishInterruptedWork: a move (final_location.h), and the
+  // named temporary file of a manifest killed between its naming and its
+  // rename.
+  void finishInterruptedMove();
+  void removeUnfinishedManifest();
   // prepareDirectory, answering the directory opened.
   Result<UniqueFd> prepareDirectoryAt(const std::string& path, bool writableByMobile);
 

@@ -1,6 +1,7 @@
 // The device manifest: the metadata of a tree (or of the whole device)
 // recorded into a fixed binary property-list file.
 #include <fcntl.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <memory>
@@ -9,7 +10,9 @@
 #include "model/manifest.h"
 #include "model/manifest_file.h"
 #include "model/progress_updater.h"
+#include "platform/file_tree.h"
 #include "platform/open_beneath.h"
+#include "platform/paths.h"
 #include "vitd_helper/operations.h"
 
 namespace vtr {
@@ -57,7 +60,7 @@ bool VTRHOperations::createDeviceManifest(const std::string& path, bool inclusiv
       output = ManifestFileWriter::CreateIn(std::move(*folder), file->path);
     }
   }
-  if (output.ok()) skip.push_back((*output)->temporaryPath());
+  if (output.ok() && !(*output)->temporaryPath().empty()) skip.push_back((*output)->temporaryPath());
   const VTRManifest::Handler discard = [](const VTRFileMetadata&, const std::string&) { return true; };
   const bool scanned = manifest.enumerateAndCollectMetaData(scanRoot, relativeTo, skip, inclusive,
                                                             output.ok() ? (*output)->handler() : discard);
@@ -68,6 +71,25 @@ bool VTRHOperations::createDeviceManifest(const std::string& path, bool inclusiv
   if (output.ok()) (void)(*output)->commit();
   VTRLog("Device manifest created (for %@)", path);
   return true;
+}
+
+void VTRHOperations::removeUnfinishedManifest() {
+  Result<CheckedPath> file = ClientPathResolver::CheckFixed(paths_.deviceManifest);
+  Result<UniqueFd> folder = file.ok() ? resolver_.openParent(*file) : Result<UniqueFd>(file.error());
+  if (!folder.ok()) return;
+  Result<std::vector<std::string>> names = DirectoryEntryNames(folder->get(), file->path);
+  if (!names.ok()) return;
+  // The name a manifest's file bears between its sync and its rename (see
+  // AtomicFile): ".DeviceManifest.plist." and six characters.
+  const std::string prefix = "." + file->name() + ".";
+  for (const std::string& name : *names) {
+    if (!HasPrefix(name, prefix) || name.size() != prefix.size() + 6) continue;
+    const std::string path = AppendPathComponent(SplitLastComponent(file->path).parent, name);
+    VTRLog("Removing %@, the file of a device manifest that was not finished", path);
+    if (::unlinkat(folder->get(), name.c_str(), 0) != 0) {
+      VTRLogError("Could not remove %@: %@", path, Error::FromErrno(path).description());
+    }
+  }
 }
 
 }  // namespace vtr

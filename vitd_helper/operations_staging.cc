@@ -7,6 +7,7 @@
 #include "platform/file_manager.h"
 #include "platform/file_tree.h"
 #include "platform/open_beneath.h"
+#include "vitd_helper/final_location.h"
 #include "vitd_helper/operations.h"
 
 namespace vtr {
@@ -59,29 +60,30 @@ bool VTRHOperations::moveStagingToFinal(const std::string& stagingPath) {
                 finalParent.error().description());
     return false;
   }
-  const std::string& finalName = final->name();
-  // A removal that fails leaves the old content in the way; the move below
-  // then fails and says so.
-  struct stat st;
-  if (::fstatat(finalParent->get(), finalName.c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0) {
-    (void)RemoveItemAt(finalParent->get(), finalName, final->path);
-  }
-  Status moved = MoveItemAt(parent->get(), staging->name(), finalParent->get(), finalName, stagingPath, final->path);
-  // The staging folder is the client's: what it held when it was moved must
-  // be the directory checked above, not something swapped in since. A
-  // rename moves an entry, not a descriptor, so it is checked after and put
-  // back when it is not.
-  if (moved.ok() &&
-      (::fstatat(finalParent->get(), finalName.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0 || !S_ISDIR(st.st_mode))) {
-    (void)MoveItemAt(finalParent->get(), finalName, parent->get(), staging->name(), final->path, stagingPath);
-    moved = Error(EAGAIN, stagingPath + " changed while it was moved");
+  FinalLocation location(std::move(*finalParent), final->path, resolver_);
+  location.finishInterruptedMove();  // what a move that failed before left
+  Status moved = location.receive(parent->get(), staging->name(), staged, staging->path);
+  if (moved.ok() && !location.putReadyInPlace().ok()) {
+    // The staging folder is taken already: without the old content (which
+    // goes in any case) the new needs one rename and no record.
+    location.discard();
+    moved = location.putReadyInPlace();
   }
   if (!moved.ok()) {
+    // The old content is discarded whatever happens to the new.
+    location.discard();
     VTRLogError("Could not move %@ to %@ with error - %@", stagingPath, paths_.finalLocation,
                 moved.error().description());
     return false;
   }
   return true;
+}
+
+void VTRHOperations::finishInterruptedMove() {
+  Result<CheckedPath> final = ClientPathResolver::CheckFixed(paths_.finalLocation);
+  Result<UniqueFd> finalParent = final.ok() ? resolver_.openParent(*final) : Result<UniqueFd>(final.error());
+  if (!finalParent.ok()) return;  // no folder for it: nothing was ever moved there
+  FinalLocation(std::move(*finalParent), final->path, resolver_).finishInterruptedMove();
 }
 
 }  // namespace vtr

@@ -178,10 +178,12 @@ int OpenRawDeviceLocked() {
   return fd;
 }
 
-// Index of an entry other than which whose start the new layout moves, or -1.
-int MovedEntry(const GptImage& before, const GptImage& after, uint32_t which) {
+// Index of an existing entry whose start the new layout moves, or -1. The
+// entry being resized counts too: its file system begins where it begins,
+// and a start moved under it would point before its first block.
+int MovedEntry(const GptImage& before, const GptImage& after) {
   for (uint32_t i = 0; i < std::min<uint32_t>(before.entryCount(), kGptTableEntries); ++i) {
-    if (i != which && before.firstLba(i) != after.firstLba(i)) return static_cast<int>(i);
+    if (before.firstLba(i) != after.firstLba(i)) return static_cast<int>(i);
   }
   return -1;
 }
@@ -270,15 +272,16 @@ int adjust_partition(uint64_t requiredSize) {
   const uint64_t currentBytes = which < count ? gpt.blocksOf(which) * blockSize : 0;
 
   // The new layout, worked out before anything changes: a failure or a
-  // layout that moves another partition's start (its data would stay where
-  // it is) stops here, with the file system untouched.
+  // layout that moves any partition's start, the resized one's included
+  // (its data would stay where it is), stops here, with the file system
+  // untouched.
   GptImage adjusted = gpt.image;
   if (zarnAdjustPartition(&gpt.props, adjusted.header.data(), adjusted.table.data(), which, newBytes) != 0) {
     VTRLogError("adjustment failed");
     VTRLogError("failed to %s partition %d", verb, static_cast<int>(which));
     return 1;
   }
-  if (const int moved = MovedEntry(gpt.image, adjusted, which); moved >= 0) {
+  if (const int moved = MovedEntry(gpt.image, adjusted); moved >= 0) {
     VTRLogError("the new layout would move the start of partition %d, whose data would not move with it", moved);
     VTRLogError("failed to %s partition %d", verb, static_cast<int>(which));
     return 1;

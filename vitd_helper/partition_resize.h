@@ -9,9 +9,10 @@
 // keeps the file system never larger than its partition: a shrink resizes
 // the mounted file system first and then the table, a growth the table
 // first and then the file system. The table is written with its CRCs and
-// its backup copy, the kernel told the partition's new size, and a layout
-// that would move another partition's start (its data would not move) is
-// refused before anything changes.
+// its backup copy (one copy whole and flushed before the other is touched),
+// the kernel told the partition's new size after, and a layout that would
+// move any partition's start, the data partition's own included (its data
+// would not move), is refused before anything changes.
 //
 // Every message goes to the log (VTRLog), except the volume-manager
 // library's own, which go to standard error. Called one command at a time.

@@ -4,15 +4,19 @@
 #include <linux/fs.h>
 #include <sys/ioctl.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <cstdlib>
 #include <ctime>
+#include <regex>
 
 #include <gtest/gtest.h>
 
 #include "model/log.h"
 #include "platform/file_dates.h"
+#include "platform/unique_fd.h"
+#include "tests/support/failing_syscall.h"
 #include "tests/support/test_support.h"
 
 namespace vtr {
@@ -81,6 +85,47 @@ TEST_F(LogModelTest, AnExistingFileIsAppendedToNeverTruncated) {
   ASSERT_TRUE(model_.enableLogToFilesUnder(dir_.path(), "vitd_helper", 5));
   model_.logMessage("restarted");
   EXPECT_EQ(ReadFile(todaysFile()), "earlier run\n2026-11-21 09:30:00 +0000 restarted\n");
+}
+
+TEST_F(LogModelTest, AFullDiskCutsNoLineInTwo) {
+  if (!testing::IsRoot()) GTEST_SKIP() << "mounts a small tmpfs: needs root";
+  const std::string small = dir_ / "small";
+  ASSERT_EQ(::mkdir(small.c_str(), 0755), 0);
+  testing::TmpfsMount mount(small, "64k");
+  ASSERT_TRUE(mount.ok());
+  clock_->set(Date::FromUnix(1795253400));
+  const struct {
+    const char* what;
+    std::vector<long> failing;  // system calls made to fail
+    std::string left;           // what the file holds after the disk had room again
+  } cases[] = {
+      {"the fragment is cut off", {}, "D before\nD short\nD after\n"},
+      {"a fragment that stays ends at the next line", {SYS_ftruncate}, "D before\nD FRAGMENT\nD after\n"},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.what);
+    const std::string file = small + "/x.log";
+    ::unlink(file.c_str());
+    const std::string left = testing::RunWithFailingSyscalls(c.failing, EIO, [&] {
+      if (!model_.enableLogToFile(file)) return std::string("<not enabled>");
+      model_.logMessage("before");
+      // The rest of the disk taken, but for the file's own first page.
+      UniqueFd filler(::open((small + "/filler").c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600));
+      const std::string page(4096, 'f');
+      while (::write(filler.get(), page.data(), page.size()) > 0) {
+      }
+      filler.reset();
+      model_.logMessage(std::string(3 * 4096, 'x'));  // fits only in part
+      model_.logMessage("short");  // fits where a fragment was cut off, if it was
+      ::unlink((small + "/filler").c_str());
+      model_.logMessage("after");
+      return ReadFile(file);
+    });
+    // The date stands as "D", a fragment as "FRAGMENT".
+    std::string shown = std::regex_replace(left, std::regex("2026-11-21 09:30:00 \\+0000"), "D");
+    shown = std::regex_replace(shown, std::regex("x{16,}"), "FRAGMENT");
+    EXPECT_EQ(shown, c.left);
+  }
 }
 
 TEST_F(LogModelTest, FileNameOfTheDayPadsTheYearWithSpaces) {

@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <ftw.h>
+#include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -99,6 +100,14 @@ LogCapture::LogCapture() : log_(std::make_shared<MemorySystemLog>()) {
 }
 
 LogCapture::~LogCapture() { VTRLogModel::sharedInstance().setSystemLog(previous_); }
+
+TmpfsMount::TmpfsMount(const std::string& path, const std::string& size) : path_(path) {
+  ok_ = ::mount("tmpfs", path.c_str(), "tmpfs", 0, ("size=" + size + ",mode=0755").c_str()) == 0;
+}
+
+TmpfsMount::~TmpfsMount() {
+  if (ok_) ::umount2(path_.c_str(), MNT_DETACH);
+}
 
 bool IsRoot() { return ::geteuid() == 0; }
 

@@ -64,6 +64,22 @@ class LogCapture {
   std::shared_ptr<SystemLog> previous_;
 };
 
+// A tmpfs of size (as mount's "size=", e.g. "48m") mounted at path, an
+// existing directory, for the life of the object and detached even when the
+// test fails. ok() is false when it could not be mounted (needs root).
+class TmpfsMount {
+ public:
+  TmpfsMount(const std::string& path, const std::string& size);
+  ~TmpfsMount();
+  TmpfsMount(const TmpfsMount&) = delete;
+  TmpfsMount& operator=(const TmpfsMount&) = delete;
+  bool ok() const { return ok_; }
+
+ private:
+  std::string path_;
+  bool ok_ = false;
+};
+
 // True when the tests run as root (ownership and mount tests need it).
 bool IsRoot();
 

@@ -124,6 +124,14 @@ std::vector<XpcObject> HelperSandbox::request(const XpcObject& request, size_t e
   return messages;
 }
 
+std::optional<bool> Answer(HelperSandbox& sandbox, const std::string& key, XpcObject parameter,
+                           std::chrono::milliseconds quiet) {
+  for (const XpcObject& reply : sandbox.request(XpcObject::Dictionary({{key, std::move(parameter)}}), 1, quiet)) {
+    if (const XpcObject* response = reply.find("Response")) return response->boolValue();
+  }
+  return std::nullopt;
+}
+
 HelperSandbox::RunResult HelperSandbox::run(const std::string& executable,
                                             const std::vector<std::string>& args) const {
   int out[2];

@@ -92,6 +92,11 @@ class HelperSandbox {
   int endingSignal_ = 0;
 };
 
+// The one "Response" to {key: parameter} sent to sandbox, or nullopt when
+// none came before a silence of quiet.
+std::optional<bool> Answer(HelperSandbox& sandbox, const std::string& key, XpcObject parameter,
+                           std::chrono::milliseconds quiet = std::chrono::milliseconds(3000));
+
 // The vitd_helper and vitdctl executables of this build, and vitdctl built
 // without an entitlement and with a string-valued one.
 std::string HelperExecutable();

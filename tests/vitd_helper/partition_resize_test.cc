@@ -206,5 +206,53 @@ TEST_F(PartitionResizeTest, ANewPartitionIsWrittenWithBothCopiesOfTheTable) {
   EXPECT_EQ(made.name()[0], 'N');
 }
 
+TEST_F(PartitionResizeTest, APowerCutDuringTheTableWriteLeavesOneWholeCopy) {
+  MakeImage(image_, kLayout);
+  UniqueFd fd(::open(image_.c_str(), O_RDWR | O_CLOEXEC));
+  Result<GptImage> old = ReadGptImage(fd.get(), kBlock);
+  ASSERT_TRUE(old.ok());
+  GptImage grown = *old;
+  StoreU64(&grown.table[kGptEntrySize + kZarnEntryEndOffset], old->lastLba(1) + 100);
+  Result<std::vector<GptWrite>> writes = PlanGptWrites(kBlock, kBlocks, grown);
+  ASSERT_TRUE(writes.ok());
+  std::vector<std::string> original;
+  for (const GptWrite& w : *writes) {
+    original.emplace_back(w.bytes.size(), '\0');
+    ASSERT_EQ(::pread(fd.get(), original.back().data(), w.bytes.size(), static_cast<off_t>(w.offset)),
+              static_cast<ssize_t>(w.bytes.size()));
+  }
+  auto put = [&](uint64_t offset, const void* bytes, size_t size) {
+    ASSERT_EQ(::pwrite(fd.get(), bytes, size, static_cast<off_t>(offset)), static_cast<ssize_t>(size));
+  };
+  // A power cut keeps every write made before the last flush, and of the
+  // writes after it each one not at all, torn (its first 512-byte sector
+  // alone) or whole, in any mix.
+  size_t flushed = 0;
+  for (size_t last = 0; last < writes->size(); ++last) {
+    if (!(*writes)[last].flushAfter) continue;
+    size_t mixes = 1;
+    for (size_t k = flushed; k <= last; ++k) mixes *= 3;
+    for (size_t mix = 0; mix < mixes; ++mix) {
+      std::string landed;
+      for (size_t k = 0, digits = mix; k < writes->size(); ++k) {
+        const GptWrite& w = (*writes)[k];
+        put(w.offset, original[k].data(), original[k].size());
+        const size_t kept[] = {0, 512, w.bytes.size()};
+        const size_t how = k < flushed ? 2 : k <= last ? digits % 3 : 0;
+        if (k >= flushed && k <= last) digits /= 3;
+        put(w.offset, w.bytes.data(), kept[how]);
+        landed += "-t="[how];
+      }
+      Result<GptValidity> seen = CheckGpt(fd.get(), kBlock, kBlocks);
+      ASSERT_TRUE(seen.ok());
+      EXPECT_TRUE((seen->primaryHeaderCrc && seen->primaryTableCrc) || (seen->backupHeaderCrc && seen->backupTableCrc))
+          << "writes landed as " << landed << " (- none, t torn, = whole)";
+    }
+    flushed = last + 1;
+  }
+  ASSERT_TRUE(WriteGptWithBackup(fd.get(), kBlock, kBlocks, grown).ok());
+  EXPECT_TRUE(CheckGpt(fd.get(), kBlock, kBlocks)->valid());
+}
+
 }  // namespace
 }  // namespace vtr::testing

@@ -155,6 +155,7 @@ class DataPartitionTest : public ::testing::Test {
     auto node = [&](const std::string& device, const std::string& at) {
       struct stat st;
       ASSERT_EQ(::stat(device.c_str(), &st), 0) << device;
+      ::unlink(sandbox_.host(at).c_str());  // a node of the disk made before
       ASSERT_EQ(::mknod(sandbox_.host(at).c_str(), S_IFBLK | 0600, st.st_rdev), 0) << at;
     };
     node(loop_->path(), "/dev/rdisk0s1");
@@ -240,11 +241,12 @@ class DataPartitionTest : public ::testing::Test {
     EXPECT_NE(verdict.find("No problems found"), std::string::npos) << verdict;
   }
 
-  // For a disk the command must not change: it answers false with line in
-  // the log, and every entry stays as it was in a valid table.
-  void expectRefusedAndUnchanged(const std::string& line) {
+  // For a disk the command (expand unless said) must not change: it answers
+  // false with line in the log, and every entry stays as it was in a valid
+  // table.
+  void expectRefusedAndUnchanged(const std::string& line, const std::string& key = "expandDataPartition:") {
     const std::map<std::string, Entry> before = Dump(loop_->path());
-    EXPECT_EQ(command("expandDataPartition:"), false);
+    EXPECT_EQ(command(key), false);
     EXPECT_NE(ReadFile(sandbox_.dayLogPath()).find(line), std::string::npos) << sandbox_.log();
     const std::map<std::string, Entry> after = Dump(loop_->path());
     for (const auto& [name, entry] : before) {
@@ -397,11 +399,28 @@ TEST_F(DataPartitionTest, AnUnmountedDataPartitionIsNotResized) {
   expectRefusedAndUnchanged("filesystem must be mounted (mountPoint=(null),which=1,nPartitions=3,newSize=");
 }
 
-TEST_F(DataPartitionTest, ALayoutThatWouldMoveAnotherPartitionIsRefusedBeforeTheFileSystemChanges) {
-  MAKE_DISK_OR_SKIP({{"System", 256, 16384}, {"Data", 16640, 262144}, {"Update", 278784, 16384}});
-  const uint64_t bytes = fileSystemBytes();
-  expectRefusedAndUnchanged("the new layout would move the start of partition 2");
-  EXPECT_EQ(fileSystemBytes(), bytes);
+TEST_F(DataPartitionTest, ALayoutThatWouldMoveAPartitionIsRefusedBeforeTheFileSystemChanges) {
+  const struct {
+    std::vector<Entry> layout;
+    std::string key;
+    std::string line;
+  } cases[] = {
+      {{{"System", 256, 16384}, {"Data", 16640, 262144}, {"Update", 278784, 16384}}, "expandDataPartition:",
+       "the new layout would move the start of partition 2"},
+      // A 1 MiB gap before Data, which the re-packing would close.
+      {{{"System", 256, 16384}, {"Data", 33280, 262144}, {"Update", 16640, 16384}}, "shrinkDataPartition:",
+       "the new layout would move the start of partition 1"},
+      {{{"System", 256, 16384}, {"Data", 33280, 262144}, {"Update", 16640, 16384}}, "expandDataPartition:",
+       "the new layout would move the start of partition 1"},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.key + " " + c.line);
+    TearDown();
+    MAKE_DISK_OR_SKIP(c.layout);
+    const uint64_t bytes = fileSystemBytes();
+    expectRefusedAndUnchanged(c.line, c.key);
+    EXPECT_EQ(fileSystemBytes(), bytes);
+  }
 }
 
 TEST_F(DataPartitionTest, WithoutADataEntryANewPartitionIsMadeAfterTheOthers) {

@@ -5,7 +5,6 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <signal.h>
-#include <sys/mount.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -34,14 +33,6 @@ XpcObject Request(const std::string& key, XpcObject parameter) {
   return XpcObject::Dictionary({{key, std::move(parameter)}});
 }
 
-// The one "Response" of a request, or nullopt.
-std::optional<bool> Answer(HelperSandbox& sandbox, const std::string& key, XpcObject parameter) {
-  for (const XpcObject& reply : sandbox.request(Request(key, std::move(parameter)), 1)) {
-    if (const XpcObject* response = reply.find("Response")) return response->boolValue();
-  }
-  return std::nullopt;
-}
-
 // A field of /proc/PID/status in kB ("VmHWM", "VmRSS"), or -1.
 long StatusKilobytes(pid_t pid, const std::string& field) {
   std::ifstream status("/proc/" + std::to_string(pid) + "/status");
@@ -62,23 +53,6 @@ std::string Hostile(const HelperSandbox& sandbox, const std::string& mode, const
   const std::string script = std::string(VTR_SOURCE_DIR) + "/tests/vitd_helper/hostile_peer.py";
   return sandbox.run("/usr/bin/python3", {script, sandbox.socketPath(), mode, arg}).output;
 }
-
-// A tmpfs mounted at a path for the life of the object, detached even when
-// the test fails.
-class TmpfsMount {
- public:
-  TmpfsMount(const std::string& path, const std::string& size) : path_(path) {
-    ok_ = ::mount("tmpfs", path.c_str(), "tmpfs", 0, ("size=" + size + ",mode=0755").c_str()) == 0;
-  }
-  ~TmpfsMount() {
-    if (ok_) ::umount2(path_.c_str(), MNT_DETACH);
-  }
-  bool ok() const { return ok_; }
-
- private:
-  std::string path_;
-  bool ok_ = false;
-};
 
 class SecurityTest : public ::testing::Test {
  protected:

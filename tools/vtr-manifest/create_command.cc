@@ -81,7 +81,8 @@ int RunCreate(const CreateOptions& options, Console& console) {
   }
   // As the helper does for the device manifest: a tree that holds the output
   // does not describe it half written.
-  walk.skip.push_back(CanonicalItemPath((*writer)->temporaryPath()));
+  // A temporary without a name (O_TMPFILE) cannot be met by the walk.
+  if (!(*writer)->temporaryPath().empty()) walk.skip.push_back(CanonicalItemPath((*writer)->temporaryPath()));
   const WalkOutcome outcome = RunWalk(walk, (*writer)->handler(), console);
   if (int status = ReportWalkOutcome(outcome, console); status != kExitOk) {
     console.print("vtr-manifest: no manifest written; " + shown + " is left as it was");
