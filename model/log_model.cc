@@ -26,6 +26,8 @@ constexpr char kProbeName[] = "testWritability.log";
 thread_local std::vector<LogLine>* t_divertedMessages = nullptr;
 // The peer whose lines this thread logs (ScopedLogPeer).
 thread_local std::optional<uint32_t> t_logPeer;
+// Failures this thread has logged (failuresLoggedOnThisThread).
+thread_local uint64_t t_failuresLogged = 0;
 
 // Budgets of peers not heard from for this long are forgotten.
 constexpr auto kPeerBudgetIdle = std::chrono::minutes(5);
@@ -63,6 +65,7 @@ void VTRLogModel::logMessage(std::string_view message, LogPriority priority) {
   }
   std::string holder;
   message = CapLine(message, &holder);
+  if (priority != LogPriority::kNotice) ++t_failuresLogged;
   if (t_logPeer) {
     uint64_t suppressed = 0;
     if (!admitPeerLine(*t_logPeer, &suppressed)) return;
@@ -79,7 +82,7 @@ void VTRLogModel::writeLine(std::string_view message, LogPriority priority) {
   std::shared_ptr<SystemLog> systemLog;
   {
     std::lock_guard<std::mutex> lock(mutex_);
-    if (logFP_ != nullptr) {
+    if (logFP_ != nullptr && priority != LogPriority::kJournalError) {
       const std::string line = Format("%@ %@\n", clock_->now(), message);
       std::fputs(line.c_str(), logFP_);
       std::fflush(logFP_);
@@ -88,6 +91,8 @@ void VTRLogModel::writeLine(std::string_view message, LogPriority priority) {
   }
   systemLog->write(message, priority);
 }
+
+uint64_t VTRLogModel::failuresLoggedOnThisThread() { return t_failuresLogged; }
 
 bool VTRLogModel::admitPeerLine(uint32_t peer, uint64_t* suppressed) {
   const auto now = std::chrono::steady_clock::now();

@@ -14,7 +14,7 @@ class Syslog final : public SystemLog {
  public:
   explicit Syslog(const char* ident) { openlog(ident, LOG_NDELAY | LOG_PID, LOG_DAEMON); }
   void write(std::string_view message, LogPriority priority) override {
-    syslog(priority == LogPriority::kError ? LOG_ERR : LOG_NOTICE, "%.*s", static_cast<int>(message.size()),
+    syslog(priority == LogPriority::kNotice ? LOG_NOTICE : LOG_ERR, "%.*s", static_cast<int>(message.size()),
            message.data());
   }
 };
@@ -53,7 +53,7 @@ std::vector<std::string> MemorySystemLog::errors() const {
   std::lock_guard<std::mutex> lock(mutex_);
   std::vector<std::string> texts;
   for (const LogLine& line : lines_) {
-    if (line.priority == LogPriority::kError) texts.push_back(line.text);
+    if (line.priority != LogPriority::kNotice) texts.push_back(line.text);
   }
   return texts;
 }

@@ -11,6 +11,7 @@
 #include "model/progress_updater.h"
 #include "platform/open_beneath.h"
 #include "vitd_helper/operations.h"
+#include "vitd_helper/failure_journal.h"
 
 namespace vtr {
 bool VTRHOperations::createDeviceManifest(const std::string& path, bool inclusive) {
@@ -63,9 +64,12 @@ bool VTRHOperations::createDeviceManifest(const std::string& path, bool inclusiv
                                                             output.ok() ? (*output)->handler() : discard);
   if (!scanned) {
     VTRLogError("Cannot create device manifest - 1");
+    JournalFailure("Cannot record the tree", path, Error::Invalid("the scan stopped (the lines above say where)"));
     return false;  // the temporary file goes; an earlier manifest stays
   }
-  if (output.ok()) (void)(*output)->commit();
+  // The answer stays true without the file; the journal says it is missing.
+  Status committed = output.ok() ? (*output)->commit() : Status(output.error());
+  if (!committed.ok()) JournalFailure("The device manifest was not written:", paths_.deviceManifest, committed.error());
   VTRLog("Device manifest created (for %@)", path);
   return true;
 }

@@ -11,6 +11,7 @@
 #include "platform/read_fully.h"
 #include "vitd_helper/operations.h"
 #include "vitd_helper/restore_workers.h"
+#include "vitd_helper/failure_journal.h"
 
 namespace vtr {
 namespace {
@@ -56,6 +57,8 @@ bool VTRHOperations::restoreAttributesUnder(const std::string& root, const std::
   }
   if (!bytes.ok()) {
     VTRLogError("Cannot open manifest file.");
+    JournalFailure("Cannot read the signed manifest", manifestPath,
+                   file.ok() ? bytes.error() : file.error());
     return false;
   }
   SigningAnchors anchors{paths_.productionAnchors, paths_.testAnchors, paths_.efiVariables, resolver_.root()};

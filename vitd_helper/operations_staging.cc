@@ -8,6 +8,7 @@
 #include "platform/file_tree.h"
 #include "platform/open_beneath.h"
 #include "vitd_helper/operations.h"
+#include "vitd_helper/failure_journal.h"
 
 namespace vtr {
 
@@ -38,7 +39,10 @@ bool VTRHOperations::moveStagingToFinal(const std::string& stagingPath) {
   std::optional<CheckedPath> staging = checkClientPath(stagingPath, ClientUse::kChange);
   if (!staging) return false;
   Result<CheckedPath> final = ClientPathResolver::CheckFixed(paths_.finalLocation);
-  if (!final.ok()) return false;
+  if (!final.ok()) {
+    JournalFailure("Cannot use the final location", paths_.finalLocation, final.error());
+    return false;
+  }
   if (PathIsWithin(final->path, staging->path) || PathIsWithin(staging->path, final->path)) {
     LogRefusal(stagingPath, Error(EINVAL, "holds or lies in " + final->path));
     return false;
@@ -50,6 +54,8 @@ bool VTRHOperations::moveStagingToFinal(const std::string& stagingPath) {
                   : Result<UniqueFd>(parent.error());
   struct stat staged;
   if (!directory.ok() || ::fstat(directory->get(), &staged) != 0) {
+    JournalFailure("Cannot open the staging directory", stagingPath,
+                   directory.ok() ? Error::FromErrno(stagingPath) : directory.error());
     VTRLogError("Staging path %@ looks wrong.", stagingPath);
     return false;
   }

@@ -1,4 +1,5 @@
 #include "vitd_helper/partition_resize.h"
+#include "vitd_helper/failure_journal.h"
 
 #include <fcntl.h>
 #include <sys/file.h>
@@ -54,11 +55,13 @@ int OpenRawDevice(int flags) {
   const char* path = Disk().rawDevice.c_str();
   const int fd = ::open(path, flags | O_CLOEXEC);
   if (fd < 0) {
+    JournalFailure("Cannot open the boot disk", path, Error::FromErrno(""));
     VTRLogError("failed to open %s", path);
     return -1;
   }
   struct stat st;
   if (::fstat(fd, &st) != 0) {
+    JournalFailure("Cannot stat the boot disk", path, Error::FromErrno(""));
     VTRLogError("failed to stat %s", path);
     ::close(fd);
     return -1;
@@ -80,11 +83,13 @@ bool ReadGpt(GptRead* gpt) {
   Result<uint32_t> blockSize = BlockSizeOf(fd);
   if (!blockSize.ok()) {
     VTRLogError("ioctl DKIOCGETBLOCKSIZE failed");
+    JournalFailure("Cannot read the block size of", path, blockSize.error());
     return false;
   }
   Result<uint64_t> blockCount = BlockCountOf(fd);
   if (!blockCount.ok()) {
     VTRLogError("ioctl DKIOCGETBLOCKCOUNT failed");
+    JournalFailure("Cannot read the block count of", path, blockCount.error());
     return false;
   }
   if (zarnInitMediaGeometry(&gpt->props, *blockCount * *blockSize, *blockSize) != 0) {
@@ -95,6 +100,7 @@ bool ReadGpt(GptRead* gpt) {
   Result<bool> signature = ReadZarnSignature(fd, *blockSize);
   if (!signature.ok()) {
     VTRLogError("Failed to read MBR from %s", path);
+    JournalFailure("Cannot read the protective MBR of", path, signature.error());
     return false;
   }
   if (!*signature) {
@@ -104,6 +110,7 @@ bool ReadGpt(GptRead* gpt) {
   Result<GptImage> image = ReadGptImage(fd, *blockSize);
   if (!image.ok()) {
     VTRLogError("Failed to read GPT header and table from %s", path);
+    JournalFailure("Cannot read the GPT of", path, image.error());
     return false;
   }
   gpt->image = *image;
@@ -170,6 +177,7 @@ int OpenRawDeviceLocked() {
   const auto deadline = std::chrono::steady_clock::now() + kLockPatience;
   while (::flock(fd, LOCK_SH | LOCK_NB) != 0) {
     if (errno != EWOULDBLOCK || std::chrono::steady_clock::now() > deadline) {
+      JournalFailure("Cannot lock the boot disk", Disk().rawDevice, Error::FromErrno(""));
       ::close(fd);
       return -1;
     }

@@ -67,6 +67,10 @@ class LogCapture {
 // True when the tests run as root (ownership and mount tests need it).
 bool IsRoot();
 
+// Sets or clears the immutable flag of path (a file or directory); false
+// when the file system or the caller cannot.
+bool SetImmutable(const std::string& path, bool on);
+
 // Whether this build runs under the address sanitizer, which changes how
 // much memory a process takes.
 #if defined(__SANITIZE_ADDRESS__)
