@@ -49,6 +49,24 @@ std::vector<std::string> MemorySystemLog::messages() const {
   return texts;
 }
 
+std::vector<std::string> MemorySystemLog::dayFileMessages() const {
+  std::lock_guard<std::mutex> lock(mutex_);
+  std::vector<std::string> texts;
+  for (const LogLine& line : lines_) {
+    if (line.priority != LogPriority::kJournalError) texts.push_back(line.text);
+  }
+  return texts;
+}
+
+std::vector<std::string> MemorySystemLog::journalOnlyMessages() const {
+  std::lock_guard<std::mutex> lock(mutex_);
+  std::vector<std::string> texts;
+  for (const LogLine& line : lines_) {
+    if (line.priority == LogPriority::kJournalError) texts.push_back(line.text);
+  }
+  return texts;
+}
+
 std::vector<std::string> MemorySystemLog::errors() const {
   std::lock_guard<std::mutex> lock(mutex_);
   std::vector<std::string> texts;

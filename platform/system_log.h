@@ -44,6 +44,10 @@ class MemorySystemLog final : public SystemLog {
  public:
   void write(std::string_view message, LogPriority priority) override;
   std::vector<std::string> messages() const;
+  // The messages a day file gets too (all but kJournalError), and those
+  // the system log alone gets.
+  std::vector<std::string> dayFileMessages() const;
+  std::vector<std::string> journalOnlyMessages() const;
   // The messages written as failures (kError and kJournalError).
   std::vector<std::string> errors() const;
   // True when some message equals text exactly.
