@@ -48,9 +48,11 @@ mount -t overlay overlay -o "lowerdir=/,upperdir=$work/upper,workdir=$work/overl
 root=$work/root
 
 if [ ${#debs[@]} -eq 0 ]; then
-  # What the package's scripts do.
+  # What the package's scripts do: the shipped sysusers.d and tmpfiles.d
+  # snippets make the mobile account and the layout.
   chroot "$root" /bin/sh -e -c '
     ldconfig
+    systemd-sysusers vitd.conf && systemd-tmpfiles --create vitd.conf
     groupadd --system vitd
     chgrp vitd /usr/local/bin/vitdctl && chmod 0750 /usr/local/bin/vitdctl
     systemctl enable vitd_helper.socket >/dev/null 2>&1' || { echo "FAIL: setting up the install"; exit 1; }
@@ -90,15 +92,12 @@ else
   disk=
 fi
 
-# The device's accounts and data area.
+# A user of the vitd group. The mobile account and the data area's layout
+# are the packages' own (sysusers.d, tmpfiles.d, applied again at boot on
+# the data partition): the checks begin on that stock layout.
 chroot "$root" /bin/sh -e -c '
-  groupadd -g 501 mobile && useradd -u 501 -g 501 -d /var/mobile -M mobile
   useradd -M -G vitd demo
-  mkdir -p /private/var/root/Library/Preferences /private/var/mobile/Library/Preferences /private/var/logs
-  mkdir -p /private/var/mobile/Media/DCIM /usr/share/vitd/anchors/production
-  printf "<plist version=\"1.0\"><dict><key>DemoMode</key><true/></dict></plist>\n" \
-    > /private/var/root/Library/Preferences/com.orvane.Vitrell.plist
-  printf "a photo" > /private/var/mobile/Media/DCIM/IMG_0001.JPG
+  mkdir -p /usr/share/vitd/anchors/production
   systemctl mask systemd-firstboot.service systemd-networkd.service >/dev/null 2>&1 || true
 ' || { echo "FAIL: preparing the container's root"; exit 1; }
 cp "$here/in_container_checks.sh" "$root/root/checks.sh"
