@@ -42,38 +42,29 @@ void MemorySystemLog::write(std::string_view message, LogPriority priority) {
   lines_.push_back({std::string(message), priority});
 }
 
-std::vector<std::string> MemorySystemLog::messages() const {
+std::vector<std::string> MemorySystemLog::textsWhere(bool (*keep)(LogPriority)) const {
   std::lock_guard<std::mutex> lock(mutex_);
   std::vector<std::string> texts;
-  for (const LogLine& line : lines_) texts.push_back(line.text);
+  for (const LogLine& line : lines_) {
+    if (keep(line.priority)) texts.push_back(line.text);
+  }
   return texts;
+}
+
+std::vector<std::string> MemorySystemLog::messages() const {
+  return textsWhere([](LogPriority) { return true; });
 }
 
 std::vector<std::string> MemorySystemLog::dayFileMessages() const {
-  std::lock_guard<std::mutex> lock(mutex_);
-  std::vector<std::string> texts;
-  for (const LogLine& line : lines_) {
-    if (line.priority != LogPriority::kJournalError) texts.push_back(line.text);
-  }
-  return texts;
+  return textsWhere([](LogPriority p) { return p != LogPriority::kJournalError; });
 }
 
 std::vector<std::string> MemorySystemLog::journalOnlyMessages() const {
-  std::lock_guard<std::mutex> lock(mutex_);
-  std::vector<std::string> texts;
-  for (const LogLine& line : lines_) {
-    if (line.priority == LogPriority::kJournalError) texts.push_back(line.text);
-  }
-  return texts;
+  return textsWhere([](LogPriority p) { return p == LogPriority::kJournalError; });
 }
 
 std::vector<std::string> MemorySystemLog::errors() const {
-  std::lock_guard<std::mutex> lock(mutex_);
-  std::vector<std::string> texts;
-  for (const LogLine& line : lines_) {
-    if (line.priority != LogPriority::kNotice) texts.push_back(line.text);
-  }
-  return texts;
+  return textsWhere([](LogPriority p) { return p != LogPriority::kNotice; });
 }
 
 bool MemorySystemLog::contains(std::string_view text) const {

@@ -55,6 +55,9 @@ class MemorySystemLog final : public SystemLog {
   void clear();
 
  private:
+  // The texts of the lines whose priority keep accepts, in order.
+  std::vector<std::string> textsWhere(bool (*keep)(LogPriority)) const;
+
   mutable std::mutex mutex_;
   std::vector<LogLine> lines_;
 };

@@ -93,6 +93,7 @@ bool VTRHOperations::restoreAttributesUnder(const std::string& root, const std::
     built = record.ok();
     return built && workers.add(key, std::move(*record));
   });
+  if (!built) JournalFailure("Cannot read a record of the signed manifest", manifestPath, Error(EINVAL, ""));
   return workers.finish() && built;
 }
 
