@@ -50,9 +50,10 @@ root=$work/root
 if [ ${#debs[@]} -eq 0 ]; then
   # What the package's scripts do: the shipped sysusers.d and tmpfiles.d
   # snippets make the mobile account and the layout.
+  systemd-sysusers --root="$root" vitd.conf && systemd-tmpfiles --root="$root" --create vitd.conf ||
+    { echo "FAIL: applying the sysusers.d and tmpfiles.d snippets"; exit 1; }
   chroot "$root" /bin/sh -e -c '
     ldconfig
-    systemd-sysusers vitd.conf && systemd-tmpfiles --create vitd.conf
     groupadd --system vitd
     chgrp vitd /usr/local/bin/vitdctl && chmod 0750 /usr/local/bin/vitdctl
     systemctl enable vitd_helper.socket >/dev/null 2>&1' || { echo "FAIL: setting up the install"; exit 1; }
