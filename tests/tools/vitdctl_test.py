@@ -3,9 +3,13 @@
 to run: requests refused before anything is sent, options on either side of
 the command, and what a user is told when nothing listens."""
 import os
+import pty
+import socket
+import struct
 import subprocess
 import sys
 import tempfile
+import threading
 import unittest
 
 BIN = None
@@ -16,7 +20,48 @@ def run(tool, *args, stdin=None):
     return subprocess.run([os.path.join(BIN, tool), *args], input=stdin, capture_output=True, text=True)
 
 
+def message(key, tag, payload):
+    """One frame holding the dictionary {key: value} of the helper's wire format."""
+    body = b"\x0a" + struct.pack("<I", 1) + struct.pack("<I", len(key)) + key.encode() + bytes([tag]) + payload
+    return struct.pack("<I", len(body)) + body
+
+
+def on_terminal(args, replies):
+    """vitdctl's output on a terminal while a stand-in helper at a socket
+    answers any request with replies."""
+    with tempfile.TemporaryDirectory() as d:
+        path = os.path.join(d, "s")
+        server = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
+        server.bind(path)
+        server.listen(1)
+
+        def serve():
+            connection, _ = server.accept()
+            connection.recv(65536)
+            connection.sendall(b"".join(replies))
+            connection.close()
+
+        threading.Thread(target=serve, daemon=True).start()
+        primary, secondary = pty.openpty()
+        p = subprocess.run([os.path.join(BIN, "vitdctl"), "--socket", path, *args], stdout=secondary,
+                           stderr=subprocess.DEVNULL)
+        os.close(secondary)
+        output = os.read(primary, 65536).decode()
+        os.close(primary)
+        server.close()
+        return p.returncode, output
+
+
 class VitdctlTest(unittest.TestCase):
+    def test_the_bar_stops_at_full_while_json_keeps_the_helpers_value(self):
+        replies = [message("Progress", 2, struct.pack("<q", 103)), message("Response", 1, b"\x01")]
+        status, bar = on_terminal(["createDeviceManifest", "/private/var"], replies)
+        self.assertEqual(status, 0)
+        self.assertIn("] 100%", bar)
+        self.assertNotIn("103", bar)
+        status, lines = on_terminal(["--json", "createDeviceManifest", "/private/var"], replies)
+        self.assertIn('{"Progress":103}', lines)
+
     def test_requests_of_the_wrong_shape_are_refused_before_sending(self):
         cases = [
             ('{"removeWorkContainer": "/x"}', 'keys end in a colon ("removeWorkContainer:")'),
