@@ -10,8 +10,8 @@
 #include "model/manifest_file.h"
 #include "model/progress_updater.h"
 #include "platform/open_beneath.h"
-#include "vitd_helper/operations.h"
 #include "vitd_helper/failure_journal.h"
+#include "vitd_helper/operations.h"
 
 namespace vtr {
 bool VTRHOperations::createDeviceManifest(const std::string& path, bool inclusive) {

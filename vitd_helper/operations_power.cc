@@ -10,8 +10,8 @@
 
 #include "model/log.h"
 #include "platform/nvram_store.h"
-#include "vitd_helper/operations.h"
 #include "vitd_helper/failure_journal.h"
+#include "vitd_helper/operations.h"
 
 namespace vtr {
 namespace {

@@ -9,9 +9,9 @@
 #include "model/signed_manifest.h"
 #include "platform/open_beneath.h"
 #include "platform/read_fully.h"
+#include "vitd_helper/failure_journal.h"
 #include "vitd_helper/operations.h"
 #include "vitd_helper/restore_workers.h"
-#include "vitd_helper/failure_journal.h"
 
 namespace vtr {
 namespace {

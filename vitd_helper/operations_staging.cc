@@ -7,8 +7,8 @@
 #include "platform/file_manager.h"
 #include "platform/file_tree.h"
 #include "platform/open_beneath.h"
-#include "vitd_helper/operations.h"
 #include "vitd_helper/failure_journal.h"
+#include "vitd_helper/operations.h"
 
 namespace vtr {
 

@@ -1,5 +1,4 @@
 #include "vitd_helper/partition_resize.h"
-#include "vitd_helper/failure_journal.h"
 
 #include <fcntl.h>
 #include <sys/file.h>
@@ -21,6 +20,7 @@
 #include "storage/mount_table.h"
 #include "storage/zarn_adjust.h"
 #include "storage/zarn_geometry.h"
+#include "vitd_helper/failure_journal.h"
 
 namespace vtr {
 namespace {

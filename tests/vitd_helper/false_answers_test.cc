@@ -70,11 +70,22 @@ TEST(FalseAnswersTest, EachNoIsExplainedInTheSystemLogAndNotInTheDayFile) {
     EXPECT_TRUE(AnyLineHas(logged, c.reason)) << c.key << ":\n" << sandbox.log();
     EXPECT_TRUE(AnyLineHas(logged, std::string(c.key) + " answered NO for ")) << c.key;
   }
+  // A true answer whose device manifest could not be written says so too.
+  ASSERT_TRUE(SetImmutable(work, true));
+  std::vector<XpcObject> scanned = sandbox.request(
+      XpcObject::Dictionary({{"createDeviceManifest:", XpcObject::Dictionary({{"Path", XpcObject::String("/private/var/locked")}})}}), 1);
+  EXPECT_TRUE(SetImmutable(work, false));
+  ASSERT_EQ(scanned.size(), 1u);
+  EXPECT_EQ(scanned[0].find("Response")->boolValue(), true);
+  EXPECT_TRUE(AnyLineHas(Lines(sandbox.log()),
+                         "The device manifest was not written: /private/var/VTRWorkContainer/DeviceManifest.plist: "))
+      << sandbox.log();
+
   // The day file has none of the journal's explanations.
   const std::string day = ReadFile(sandbox.dayLogPath());
   EXPECT_NE(day.find("Entering -[VTRHMessageResponder removeWorkContainer:]"), std::string::npos);
   for (const char* journalOnly : {"answered NO", "Cannot remove", "Cannot create or open", "No such file or directory",
-                                  "Cannot open the boot disk"}) {
+                                  "Cannot open the boot disk", "was not written"}) {
     EXPECT_EQ(day.find(journalOnly), std::string::npos) << journalOnly;
   }
   EXPECT_TRUE(SetImmutable(work + "/kept", false));
