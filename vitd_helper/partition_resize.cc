@@ -9,6 +9,7 @@
 #include <chrono>
 #include <cstring>
 #include <optional>
+#include <string>
 #include <thread>
 #include <vector>
 
@@ -204,6 +205,7 @@ void SetDataPartitionDisk(DataPartitionDisk disk) { Disk() = std::move(disk); }
 int ShrinkDataPartition() {
   std::optional<Value> usage = DiskUsage(Disk().dataVolume);
   if (!usage) {
+    JournalFailure("Cannot read the usage of the data volume", Disk().dataVolume, Error::FromErrno(""));
     VTRLogError("Cannot get disk usage.");
     return -1;
   }
@@ -246,10 +248,14 @@ int adjust_partition(uint64_t requiredSize) {
   const uint64_t blocks = requiredSize / blockSize + (requiredSize % blockSize != 0 ? 1 : 0);
   VTRLog("partition: requiredSize=%llu", blocks);
 
-  // Does it fit? Silent when it does not.
+  // Does it fit? Silent in the day file when it does not; the journal says so.
   uint64_t sum = which == count ? blocks : 0;
   for (uint32_t i = 0; i < gpt.tableEntries(); ++i) sum += i == which ? blocks : gpt.blocksOf(i);
-  if (sum > gpt.image.lastUsableLba() - gpt.image.firstUsableLba() + 1) return 1;
+  if (const uint64_t usable = gpt.image.lastUsableLba() - gpt.image.firstUsableLba() + 1; sum > usable) {
+    JournalFailure("The partitions would not fit on", Disk().rawDevice,
+                   Error(ENOSPC, std::to_string(sum) + " blocks wanted, " + std::to_string(usable) + " usable"));
+    return 1;
+  }
 
   if (blocks == 0) {
     VTRLogError("deletion of partition %d disallowed", 1);
