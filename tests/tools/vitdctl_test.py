@@ -86,6 +86,7 @@ class VitdctlTest(unittest.TestCase):
     def test_well_formed_and_raw_requests_go_out(self):
         for args, request in [
             (["send", "-"], '{"prepareWorkContainer:": "/x", "reboot:": [1], "writeNvram:": {"Name": "a", "Value": ""}}'),
+            (["send", "-"], '{"createDeviceManifest:": {"Path": "/x", "Inclusive": 1}}'),
             (["send", "--raw", "-"], '{"removeWorkContainer": {"any": 1}}'),
             (["send", "-", "--raw"], '{"zzz:": 1}'),
         ]:

@@ -64,7 +64,8 @@ const char* NameOf(Kind kind) {
 bool Fits(const Json& value, Kind kind) {
   switch (kind) {
     case Kind::kString: return value.is_string();
-    case Kind::kBoolean: return value.is_boolean();
+    // The helper reads a number as a boolean too (non-zero: YES).
+    case Kind::kBoolean: return value.is_boolean() || value.is_number();
     case Kind::kDictionary: return value.is_object();
     case Kind::kAnything: break;
   }
