@@ -3,6 +3,7 @@
 #include <sys/stat.h>
 
 #include <array>
+#include <cstring>
 #include <string_view>
 
 #include "model/file_metadata.h"
@@ -59,6 +60,7 @@ bool SetExtendedAttributesWith(const Dictionary* attributes, const std::string& 
       return false;
     }
     if (set(name, *data) != 0) {
+      VTRJournalError("Cannot set the extended attribute %@ of %@: %s", name, path, std::strerror(errno));
       VTRLogError("Could not set extended attributes on %@", path);
       return false;
     }

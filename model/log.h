@@ -5,8 +5,12 @@
 // VTRLog formats the message (printf conversions plus %@, checked when the
 // call is compiled; see platform/format.h) and hands it to the shared
 // VTRLogModel. VTRLogError does the same for a failure, which the system log
-// then carries at error priority (the day file reads the same). VTRDebugLog takes the same arguments and does nothing:
-// the step-by-step traces passed to it are never formatted nor emitted.
+// then carries at error priority (the day file reads the same).
+// VTRJournalError tells the system log alone, at error priority, why a
+// command answers NO (the step, the path, the system's error text) where the
+// day file keeps no line for it. VTRDebugLog takes the same arguments and
+// does nothing: the step-by-step traces passed to it are never formatted nor
+// emitted.
 #ifndef VTR_MODEL_LOG_H_
 #define VTR_MODEL_LOG_H_
 
@@ -23,6 +27,11 @@ void VTRLog(FormatString<std::type_identity_t<Args>...> format, const Args&... a
 template <typename... Args>
 void VTRLogError(FormatString<std::type_identity_t<Args>...> format, const Args&... args) {
   VTRLogModel::sharedInstance().logWithFormat<Args...>(LogPriority::kError, format, args...);
+}
+
+template <typename... Args>
+void VTRJournalError(FormatString<std::type_identity_t<Args>...> format, const Args&... args) {
+  VTRLogModel::sharedInstance().logWithFormat<Args...>(LogPriority::kJournalError, format, args...);
 }
 
 template <typename... Args>

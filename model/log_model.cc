@@ -26,6 +26,8 @@ constexpr char kProbeName[] = "testWritability.log";
 thread_local std::vector<LogLine>* t_divertedMessages = nullptr;
 // The peer whose lines this thread logs (ScopedLogPeer).
 thread_local std::optional<uint32_t> t_logPeer;
+// Failures this thread has logged (failuresLoggedOnThisThread).
+thread_local uint64_t t_failuresLogged = 0;
 
 // Budgets of peers not heard from for this long are forgotten.
 constexpr auto kPeerBudgetIdle = std::chrono::minutes(5);
@@ -63,6 +65,7 @@ void VTRLogModel::logMessage(std::string_view message, LogPriority priority) {
   }
   std::string holder;
   message = CapLine(message, &holder);
+  if (priority != LogPriority::kNotice) ++t_failuresLogged;
   if (t_logPeer) {
     uint64_t suppressed = 0;
     if (!admitPeerLine(*t_logPeer, &suppressed)) return;
@@ -79,7 +82,9 @@ void VTRLogModel::writeLine(std::string_view message, LogPriority priority) {
   std::shared_ptr<SystemLog> systemLog;
   {
     std::lock_guard<std::mutex> lock(mutex_);
-    if (logFP_ != nullptr) appendLine(Format("%@ %@\n", clock_->now(), message));
+    if (logFP_ != nullptr && priority != LogPriority::kJournalError) {
+      appendLine(Format("%@ %@\n", clock_->now(), message));
+    }
     systemLog = systemLog_;
   }
   systemLog->write(message, priority);
@@ -112,6 +117,8 @@ void VTRLogModel::appendLine(const std::string& line) {
   }
   if (!sized || ::ftruncate(fd, before.st_size) != 0) lineOpen_ = true;
 }
+
+uint64_t VTRLogModel::failuresLoggedOnThisThread() { return t_failuresLogged; }
 
 bool VTRLogModel::admitPeerLine(uint32_t peer, uint64_t* suppressed) {
   const auto now = std::chrono::steady_clock::now();

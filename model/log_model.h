@@ -65,10 +65,15 @@ class VTRLogModel {
   }
 
   // Appends "<date description> <message>\n" to the log file when file
-  // logging is on, with one write(2), so the line lands whole or not at all
-  // (a full disk), and sends the message alone to the system log in every
-  // case, with its priority.
+  // logging is on (never for kJournalError), with one write(2), so the line
+  // lands whole or not at all (a full disk), and sends the message alone to
+  // the system log in every case, with its priority.
   void logMessage(std::string_view message, LogPriority priority = LogPriority::kNotice);
+
+  // How many failures (kError or kJournalError) the calling thread has
+  // logged so far, diverted ones once they are written: a command that
+  // answers NO without one can be told apart.
+  static uint64_t failuresLoggedOnThisThread();
 
   // Opens path for appending (created if missing, never truncated), creating
   // its parent directory if needed. Returns false when the parent cannot be

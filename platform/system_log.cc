@@ -14,7 +14,7 @@ class Syslog final : public SystemLog {
  public:
   explicit Syslog(const char* ident) { openlog(ident, LOG_NDELAY | LOG_PID, LOG_DAEMON); }
   void write(std::string_view message, LogPriority priority) override {
-    syslog(priority == LogPriority::kError ? LOG_ERR : LOG_NOTICE, "%.*s", static_cast<int>(message.size()),
+    syslog(priority == LogPriority::kNotice ? LOG_NOTICE : LOG_ERR, "%.*s", static_cast<int>(message.size()),
            message.data());
   }
 };
@@ -42,20 +42,29 @@ void MemorySystemLog::write(std::string_view message, LogPriority priority) {
   lines_.push_back({std::string(message), priority});
 }
 
-std::vector<std::string> MemorySystemLog::messages() const {
-  std::lock_guard<std::mutex> lock(mutex_);
-  std::vector<std::string> texts;
-  for (const LogLine& line : lines_) texts.push_back(line.text);
-  return texts;
-}
-
-std::vector<std::string> MemorySystemLog::errors() const {
+std::vector<std::string> MemorySystemLog::textsWhere(bool (*keep)(LogPriority)) const {
   std::lock_guard<std::mutex> lock(mutex_);
   std::vector<std::string> texts;
   for (const LogLine& line : lines_) {
-    if (line.priority == LogPriority::kError) texts.push_back(line.text);
+    if (keep(line.priority)) texts.push_back(line.text);
   }
   return texts;
+}
+
+std::vector<std::string> MemorySystemLog::messages() const {
+  return textsWhere([](LogPriority) { return true; });
+}
+
+std::vector<std::string> MemorySystemLog::dayFileMessages() const {
+  return textsWhere([](LogPriority p) { return p != LogPriority::kJournalError; });
+}
+
+std::vector<std::string> MemorySystemLog::journalOnlyMessages() const {
+  return textsWhere([](LogPriority p) { return p == LogPriority::kJournalError; });
+}
+
+std::vector<std::string> MemorySystemLog::errors() const {
+  return textsWhere([](LogPriority p) { return p != LogPriority::kNotice; });
 }
 
 bool MemorySystemLog::contains(std::string_view text) const {

@@ -13,8 +13,11 @@
 namespace vtr {
 
 // How urgent a message is: a failure (a command that cannot do its work, a
-// refused client or path) or a notice of what happens.
-enum class LogPriority { kNotice, kError };
+// refused client or path) or a notice of what happens. kJournalError is a
+// failure told to the system log alone: the reason behind a NO answer that
+// the helper's own day file has no line for (the system log carries it as
+// kError).
+enum class LogPriority { kNotice, kError, kJournalError };
 
 // One message with its priority, as held until it is written.
 struct LogLine {
@@ -41,13 +44,20 @@ class MemorySystemLog final : public SystemLog {
  public:
   void write(std::string_view message, LogPriority priority) override;
   std::vector<std::string> messages() const;
-  // The messages written as failures.
+  // The messages a day file gets too (all but kJournalError), and those
+  // the system log alone gets.
+  std::vector<std::string> dayFileMessages() const;
+  std::vector<std::string> journalOnlyMessages() const;
+  // The messages written as failures (kError and kJournalError).
   std::vector<std::string> errors() const;
   // True when some message equals text exactly.
   bool contains(std::string_view text) const;
   void clear();
 
  private:
+  // The texts of the lines whose priority keep accepts, in order.
+  std::vector<std::string> textsWhere(bool (*keep)(LogPriority)) const;
+
   mutable std::mutex mutex_;
   std::vector<LogLine> lines_;
 };

@@ -53,6 +53,10 @@ std::vector<std::string> ClientPathResolver::closedTreesWithin(const CheckedPath
   return within;
 }
 
-void LogRefusal(std::string_view path, const Error& why) { VTRLogError("Refused path %@: %@", path, why.message()); }
+void LogRefusal(std::string_view path, const Error& why) {
+  VTRLogError("Refused path %@: %@", path, why.message());
+  // The day file's line names the rule; the journal adds the system's text.
+  if (why.code() != 0) VTRJournalError("Refused path %@: %@", path, why.description());
+}
 
 }  // namespace vtr

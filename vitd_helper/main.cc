@@ -21,6 +21,7 @@ namespace {
 
 constexpr char kUsage[] =
     "Usage: vitd_helper [--root DIR] [--stderr]\n"
+    "       vitd_helper --help | --version\n"
     "\n"
     "The demo-mode privileged helper. Serves the demo-mode daemon on the Unix\n"
     "socket /run/com.orvane.vitrelldhelper.sock (or the socket systemd passes),\n"
@@ -33,7 +34,14 @@ constexpr char kUsage[] =
     "               restarts only a PID namespace the helper is the first process of\n"
     "  --stderr     send the system-log copy of each message to standard error\n"
     "               instead of syslog\n"
-    "  --help       show this text\n";
+    "  --help       show this text\n"
+    "  --version    show the version\n"
+    "\n"
+    "Exit status: 0 ended on request or by SIGTERM, 1 cannot serve (the system\n"
+    "log says why), 64 usage error.\n";
+
+// Exit status of a bad command line (sysexits' EX_USAGE).
+constexpr int kExitUsage = 64;
 
 struct Options {
   std::string root;
@@ -46,6 +54,7 @@ Options ParseOptions(int argc, char** argv) {
       {"root", required_argument, nullptr, 'r'},
       {"stderr", no_argument, nullptr, 's'},
       {"help", no_argument, nullptr, 'h'},
+      {"version", no_argument, nullptr, 'V'},
       {nullptr, 0, nullptr, 0},
   };
   Options options;
@@ -61,14 +70,18 @@ Options ParseOptions(int argc, char** argv) {
       case 'h':
         std::fputs(kUsage, stdout);
         std::exit(0);
+      case 'V':
+        std::printf("vitd_helper (vitd) %s\n", VTR_VERSION);
+        std::exit(0);
       default:
         std::fputs(kUsage, stderr);
-        std::exit(2);
+        std::exit(kExitUsage);
     }
   }
   if (optind != argc) {
+    std::fprintf(stderr, "vitd_helper: unexpected argument '%s'\n", argv[optind]);
     std::fputs(kUsage, stderr);
-    std::exit(2);
+    std::exit(kExitUsage);
   }
   return options;
 }

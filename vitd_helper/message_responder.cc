@@ -58,9 +58,17 @@ void VTRHMessageResponder::handleXPCMessage(const XpcObject& request) {
       VTRLogError("%@ does not respond to %@.", kResponderClass, key);
       return;
     }
+    const uint64_t failuresBefore = VTRLogModel::failuresLoggedOnThisThread();
     if ((this->*command->method)(parameter)) {
       sendPassResponse();
     } else {
+      // The journal names the command of every false answer; the lines
+      // before it say why (a step that said nothing is named as such).
+      if (VTRLogModel::failuresLoggedOnThisThread() == failuresBefore) {
+        VTRJournalError("%@ answered NO for %@ (no step logged why)", key, parameter);
+      } else {
+        VTRJournalError("%@ answered NO for %@", key, parameter);
+      }
       sendFailResponse();
     }
   }

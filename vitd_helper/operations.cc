@@ -11,6 +11,7 @@
 #include "platform/file_tree.h"
 #include "platform/open_beneath.h"
 #include "platform/paths.h"
+#include "vitd_helper/failure_journal.h"
 
 namespace vtr {
 namespace {
@@ -76,20 +77,32 @@ bool VTRHOperations::migratePreferencesFile() {
   const std::string target = AppendPathComponent(paths_.mobilePreferencesFolder, name);
   Result<CheckedPath> sourceFolder = ClientPathResolver::CheckFixed(paths_.rootPreferencesFolder);
   Result<CheckedPath> targetFolder = ClientPathResolver::CheckFixed(paths_.mobilePreferencesFolder);
-  if (!sourceFolder.ok() || !targetFolder.ok()) return false;
-  // Nothing to move is no failure worth a line; a link on the way is.
+  if (!sourceFolder.ok() || !targetFolder.ok()) {
+    JournalFailure("Cannot use the preferences folders", source,
+                   sourceFolder.ok() ? targetFolder.error() : sourceFolder.error());
+    return false;
+  }
+  // Nothing to move is no failure worth a line in the day file; a link on
+  // the way is. The journal says which it was.
   Result<UniqueFd> from = resolver_.openDirectory(*sourceFolder);
   if (!from.ok()) {
     if (from.error().code() != ENOENT) LogRefusal(source, from.error());
+    JournalFailure("Nothing to move: cannot open", paths_.rootPreferencesFolder, from.error());
     return false;
   }
-  if (!EntryExists(from->get(), name)) return false;
+  if (!EntryExists(from->get(), name)) {
+    JournalFailure("Nothing to move:", source, Error(ENOENT, ""));
+    return false;
+  }
   Result<UniqueFd> to = resolver_.openDirectory(*targetFolder);
   if (!to.ok() && to.error().code() != ENOENT) {
     LogRefusal(target, to.error());
     return false;
   }
-  if (to.ok() && EntryExists(to->get(), name)) return false;
+  if (to.ok() && EntryExists(to->get(), name)) {
+    JournalFailure("Not moving over an existing", target, Error(EEXIST, ""));
+    return false;
+  }
   Result<UniqueFd> file = OpenEntryNoFollow(from->get(), name, O_PATH, source);
   struct stat st;
   if (file.ok() && (::fstat(file->get(), &st) != 0 || !S_ISREG(st.st_mode) || st.st_nlink != 1)) {
@@ -99,16 +112,21 @@ bool VTRHOperations::migratePreferencesFile() {
     LogRefusal(source, file.error());
     return false;
   }
-  if (!to.ok() || !MoveItemAt(from->get(), name, to->get(), name, source, target).ok()) {
+  Status moved = to.ok() ? MoveItemAt(from->get(), name, to->get(), name, source, target) : Status(to.error());
+  if (!moved.ok()) {
     VTRLogError("Couldn't move %@ to %@", source, target);
+    JournalFailure("Cannot move to", target, moved.error());
     return false;
   }
   // The moved file, as it stands now in mobile's folder: whatever mobile may
   // have put there meanwhile is given to it only if it is a file of its own
   // kind (one link, no link to follow).
-  Result<UniqueFd> moved = OpenEntryNoFollow(to->get(), name, O_PATH, target);
-  if (!moved.ok() || !GiveToAccount(moved->get(), paths_.mobileAccount, target).ok()) {
+  Result<UniqueFd> movedFile = OpenEntryNoFollow(to->get(), name, O_PATH, target);
+  Status given = movedFile.ok() ? GiveToAccount(movedFile->get(), paths_.mobileAccount, target)
+                                : Status(movedFile.error());
+  if (!given.ok()) {
     VTRLogError("Couldn't change ownership for %@", target);
+    JournalFailure("Cannot give to the mobile account", target, given.error());
     return false;
   }
   return true;
@@ -119,10 +137,15 @@ Result<UniqueFd> VTRHOperations::prepareDirectoryAt(const std::string& path, boo
   if (!checked) return Error(EPERM, path);
   Result<UniqueFd> dir = resolver_.openDirectory(*checked, /*create=*/true);
   if (!dir.ok()) {
-    // A directory that cannot be made fails without a word; a link or a
-    // file standing in the way is a refusal.
+    // A directory that cannot be made fails without a word in the day file
+    // (the journal says why); a link or a file standing in the way is a
+    // refusal.
     const int code = dir.error().code();
-    if (code == ELOOP || code == ENOTDIR) LogRefusal(path, dir.error());
+    if (code == ELOOP || code == ENOTDIR) {
+      LogRefusal(path, dir.error());
+    } else {
+      JournalFailure("Cannot create or open the directory", path, dir.error());
+    }
     return dir.error();
   }
   if (writableByMobile) {
@@ -130,12 +153,15 @@ Result<UniqueFd> VTRHOperations::prepareDirectoryAt(const std::string& path, boo
     // no argument for their last conversion; their texts are kept as they are.
     struct stat st;
     if (::fstat(dir->get(), &st) != 0) {
+      const Error error = Error::FromErrno(path);
       VTRLogError("%s: Cannot get attribute from %@", path, nullptr);
-      return Error::FromErrno(path);
+      JournalFailure("Cannot read the permissions of", path, error);
+      return error;
     }
     if (::fchmod(dir->get(), (st.st_mode & 07777) | 0077) != 0) {
       const Error error = Error::FromErrno(path);
       VTRLogError("%s: Cannot set attribute for %@ - %@", path, error.description(), nullptr);
+      JournalFailure("Cannot open the permissions of", path, error);
       return error;
     }
   }
@@ -184,7 +210,9 @@ bool VTRHOperations::removeDirectory(const std::string& path) {
     return false;
   }
   if (!EntryExists(parent->get(), checked->name())) return true;
-  return RemoveItemAt(parent->get(), checked->name(), checked->path).ok();
+  Status removed = RemoveItemAt(parent->get(), checked->name(), checked->path);
+  if (!removed.ok()) JournalFailure("Cannot remove", path, removed.error());
+  return removed.ok();
 }
 
 }  // namespace vtr

@@ -13,6 +13,7 @@
 #include "platform/file_tree.h"
 #include "platform/open_beneath.h"
 #include "platform/paths.h"
+#include "vitd_helper/failure_journal.h"
 #include "vitd_helper/operations.h"
 
 namespace vtr {
@@ -66,9 +67,12 @@ bool VTRHOperations::createDeviceManifest(const std::string& path, bool inclusiv
                                                             output.ok() ? (*output)->handler() : discard);
   if (!scanned) {
     VTRLogError("Cannot create device manifest - 1");
+    JournalFailure("Cannot record the tree", path, Error::Invalid("the scan stopped (the lines above say where)"));
     return false;  // the temporary file goes; an earlier manifest stays
   }
-  if (output.ok()) (void)(*output)->commit();
+  // The answer stays true without the file; the journal says it is missing.
+  Status committed = output.ok() ? (*output)->commit() : Status(output.error());
+  if (!committed.ok()) JournalFailure("The device manifest was not written:", paths_.deviceManifest, committed.error());
   VTRLog("Device manifest created (for %@)", path);
   return true;
 }

@@ -10,6 +10,7 @@
 
 #include "model/log.h"
 #include "platform/nvram_store.h"
+#include "vitd_helper/failure_journal.h"
 #include "vitd_helper/operations.h"
 
 namespace vtr {
@@ -29,10 +30,14 @@ bool VTRHOperations::writeNVRam(const std::optional<std::string>& name, const st
   Result<NvramStore> store = NvramStore::Open(resolver_.root(), paths_.efiVariables);
   if (!store.ok()) {
     VTRLogError(kNoOptionsNode);
+    JournalFailure("Cannot open the firmware variables", paths_.efiVariables, store.error());
     return false;
   }
-  if (!name || !value || !store->write(*name, BytesOf(*value)).ok()) {
+  Status written = !name || !value ? Status(Error::Invalid("\"Name\" and \"Value\" must both be strings"))
+                                   : store->write(*name, BytesOf(*value));
+  if (!written.ok()) {
     VTRLogError(kWriteFailed);
+    JournalFailure("Cannot write the firmware variable", name.value_or("(none)"), written.error());
     return false;
   }
   // The firmware commits each write itself; the "sync" checks that what it
@@ -41,6 +46,8 @@ bool VTRHOperations::writeNVRam(const std::optional<std::string>& name, const st
   const std::span<const uint8_t> wanted = BytesOf(*value);
   if (!held.ok() || !std::ranges::equal(held->value_or(std::vector<uint8_t>()), wanted)) {
     VTRLogError(kSyncFailed);
+    JournalFailure("Cannot read back the firmware variable", *name,
+                   held.ok() ? Error::Invalid("it holds another value") : held.error());
     return false;
   }
   return true;
@@ -50,10 +57,13 @@ bool VTRHOperations::deleteNvram(const std::optional<std::string>& name) {
   Result<NvramStore> store = NvramStore::Open(resolver_.root(), paths_.efiVariables);
   if (!store.ok()) {
     VTRLogError(kNoOptionsNode);
+    JournalFailure("Cannot open the firmware variables", paths_.efiVariables, store.error());
     return false;
   }
-  if (!name || !store->remove(*name).ok()) {
+  Status removed = name ? store->remove(*name) : Status(Error::Invalid("the variable name must be a string"));
+  if (!removed.ok()) {
     VTRLogError(kSyncFailed);
+    JournalFailure("Cannot remove the firmware variable", name.value_or("(none)"), removed.error());
     return false;
   }
   return true;

@@ -9,6 +9,7 @@
 #include "model/signed_manifest.h"
 #include "platform/open_beneath.h"
 #include "platform/read_fully.h"
+#include "vitd_helper/failure_journal.h"
 #include "vitd_helper/operations.h"
 #include "vitd_helper/restore_workers.h"
 
@@ -56,6 +57,8 @@ bool VTRHOperations::restoreAttributesUnder(const std::string& root, const std::
   }
   if (!bytes.ok()) {
     VTRLogError("Cannot open manifest file.");
+    JournalFailure("Cannot read the signed manifest", manifestPath,
+                   file.ok() ? bytes.error() : file.error());
     return false;
   }
   SigningAnchors anchors{paths_.productionAnchors, paths_.testAnchors, paths_.efiVariables, resolver_.root()};
@@ -90,6 +93,7 @@ bool VTRHOperations::restoreAttributesUnder(const std::string& root, const std::
     built = record.ok();
     return built && workers.add(key, std::move(*record));
   });
+  if (!built) JournalFailure("Cannot read a record of the signed manifest", manifestPath, Error(EINVAL, ""));
   return workers.finish() && built;
 }
 

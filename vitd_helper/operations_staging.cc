@@ -7,6 +7,7 @@
 #include "platform/file_manager.h"
 #include "platform/file_tree.h"
 #include "platform/open_beneath.h"
+#include "vitd_helper/failure_journal.h"
 #include "vitd_helper/final_location.h"
 #include "vitd_helper/operations.h"
 
@@ -39,7 +40,10 @@ bool VTRHOperations::moveStagingToFinal(const std::string& stagingPath) {
   std::optional<CheckedPath> staging = checkClientPath(stagingPath, ClientUse::kChange);
   if (!staging) return false;
   Result<CheckedPath> final = ClientPathResolver::CheckFixed(paths_.finalLocation);
-  if (!final.ok()) return false;
+  if (!final.ok()) {
+    JournalFailure("Cannot use the final location", paths_.finalLocation, final.error());
+    return false;
+  }
   if (PathIsWithin(final->path, staging->path) || PathIsWithin(staging->path, final->path)) {
     LogRefusal(stagingPath, Error(EINVAL, "holds or lies in " + final->path));
     return false;
@@ -51,6 +55,8 @@ bool VTRHOperations::moveStagingToFinal(const std::string& stagingPath) {
                   : Result<UniqueFd>(parent.error());
   struct stat staged;
   if (!directory.ok() || ::fstat(directory->get(), &staged) != 0) {
+    JournalFailure("Cannot open the staging directory", stagingPath,
+                   directory.ok() ? Error::FromErrno(stagingPath) : directory.error());
     VTRLogError("Staging path %@ looks wrong.", stagingPath);
     return false;
   }

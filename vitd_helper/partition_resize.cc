@@ -9,6 +9,7 @@
 #include <chrono>
 #include <cstring>
 #include <optional>
+#include <string>
 #include <thread>
 #include <vector>
 
@@ -20,6 +21,7 @@
 #include "storage/mount_table.h"
 #include "storage/zarn_adjust.h"
 #include "storage/zarn_geometry.h"
+#include "vitd_helper/failure_journal.h"
 
 namespace vtr {
 namespace {
@@ -54,11 +56,13 @@ int OpenRawDevice(int flags) {
   const char* path = Disk().rawDevice.c_str();
   const int fd = ::open(path, flags | O_CLOEXEC);
   if (fd < 0) {
+    JournalFailure("Cannot open the boot disk", path, Error::FromErrno(""));
     VTRLogError("failed to open %s", path);
     return -1;
   }
   struct stat st;
   if (::fstat(fd, &st) != 0) {
+    JournalFailure("Cannot stat the boot disk", path, Error::FromErrno(""));
     VTRLogError("failed to stat %s", path);
     ::close(fd);
     return -1;
@@ -80,11 +84,13 @@ bool ReadGpt(GptRead* gpt) {
   Result<uint32_t> blockSize = BlockSizeOf(fd);
   if (!blockSize.ok()) {
     VTRLogError("ioctl DKIOCGETBLOCKSIZE failed");
+    JournalFailure("Cannot read the block size of", path, blockSize.error());
     return false;
   }
   Result<uint64_t> blockCount = BlockCountOf(fd);
   if (!blockCount.ok()) {
     VTRLogError("ioctl DKIOCGETBLOCKCOUNT failed");
+    JournalFailure("Cannot read the block count of", path, blockCount.error());
     return false;
   }
   if (zarnInitMediaGeometry(&gpt->props, *blockCount * *blockSize, *blockSize) != 0) {
@@ -95,6 +101,7 @@ bool ReadGpt(GptRead* gpt) {
   Result<bool> signature = ReadZarnSignature(fd, *blockSize);
   if (!signature.ok()) {
     VTRLogError("Failed to read MBR from %s", path);
+    JournalFailure("Cannot read the protective MBR of", path, signature.error());
     return false;
   }
   if (!*signature) {
@@ -104,6 +111,7 @@ bool ReadGpt(GptRead* gpt) {
   Result<GptImage> image = ReadGptImage(fd, *blockSize);
   if (!image.ok()) {
     VTRLogError("Failed to read GPT header and table from %s", path);
+    JournalFailure("Cannot read the GPT of", path, image.error());
     return false;
   }
   gpt->image = *image;
@@ -170,6 +178,7 @@ int OpenRawDeviceLocked() {
   const auto deadline = std::chrono::steady_clock::now() + kLockPatience;
   while (::flock(fd, LOCK_SH | LOCK_NB) != 0) {
     if (errno != EWOULDBLOCK || std::chrono::steady_clock::now() > deadline) {
+      JournalFailure("Cannot lock the boot disk", Disk().rawDevice, Error::FromErrno(""));
       ::close(fd);
       return -1;
     }
@@ -198,6 +207,7 @@ void SetDataPartitionDisk(DataPartitionDisk disk) { Disk() = std::move(disk); }
 int ShrinkDataPartition() {
   std::optional<Value> usage = DiskUsage(Disk().dataVolume);
   if (!usage) {
+    JournalFailure("Cannot read the usage of the data volume", Disk().dataVolume, Error::FromErrno(""));
     VTRLogError("Cannot get disk usage.");
     return -1;
   }
@@ -240,10 +250,14 @@ int adjust_partition(uint64_t requiredSize) {
   const uint64_t blocks = requiredSize / blockSize + (requiredSize % blockSize != 0 ? 1 : 0);
   VTRLog("partition: requiredSize=%llu", blocks);
 
-  // Does it fit? Silent when it does not.
+  // Does it fit? Silent in the day file when it does not; the journal says so.
   uint64_t sum = which == count ? blocks : 0;
   for (uint32_t i = 0; i < gpt.tableEntries(); ++i) sum += i == which ? blocks : gpt.blocksOf(i);
-  if (sum > gpt.image.lastUsableLba() - gpt.image.firstUsableLba() + 1) return 1;
+  if (const uint64_t usable = gpt.image.lastUsableLba() - gpt.image.firstUsableLba() + 1; sum > usable) {
+    JournalFailure("The partitions would not fit on", Disk().rawDevice,
+                   Error(ENOSPC, std::to_string(sum) + " blocks wanted, " + std::to_string(usable) + " usable"));
+    return 1;
+  }
 
   if (blocks == 0) {
     VTRLogError("deletion of partition %d disallowed", 1);

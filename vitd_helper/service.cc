@@ -67,6 +67,13 @@ int HelperService::createXPCListener() {
   Result<std::unique_ptr<Listener>> listener = Listener::Create(socketPath_, options);
   if (!listener.ok()) {
     VTRLogError("Could not create XPC listener.");
+    const Error& why = listener.error();
+    const std::string where = socketPath_.empty() ? "the socket systemd passes" : socketPath_;
+    if (why.code() == EADDRINUSE) {
+      VTRJournalError("Cannot listen: another helper is already listening on %@ (%@)", where, why.description());
+    } else {
+      VTRJournalError("Cannot listen on %@: %@", where, why.description());
+    }
     return 1;
   }
   listener_ = std::move(*listener);

@@ -65,6 +65,17 @@ TEST_F(LogModelTest, WithoutFileOnlyTheSystemLogGetsTheBareMessageWithItsPriorit
   EXPECT_EQ(systemLog_->errors(), std::vector<std::string>{"Couldn't move /a to /b"});
 }
 
+TEST_F(LogModelTest, AJournalErrorReachesTheSystemLogAsAFailureButNeverTheDayFile) {
+  clock_->set(Date::FromUnix(1795253400));
+  ASSERT_TRUE(model_.enableLogToFile(dir_ / "x.log"));
+  const uint64_t before = VTRLogModel::failuresLoggedOnThisThread();
+  model_.logMessage("why", LogPriority::kJournalError);
+  model_.logMessage("told", LogPriority::kNotice);
+  EXPECT_EQ(ReadFile(dir_ / "x.log"), "2026-11-21 09:30:00 +0000 told\n");
+  EXPECT_EQ(systemLog_->errors(), std::vector<std::string>{"why"});
+  EXPECT_EQ(VTRLogModel::failuresLoggedOnThisThread(), before + 1);
+}
+
 TEST_F(LogModelTest, FileLinesCarryTheUtcDateAndKeepATrailingNewline) {
   clock_->set(Date::FromUnix(1795253400));  // 2026-11-21 09:30:00 UTC
   ASSERT_TRUE(model_.enableLogToFile(dir_ / "x.log"));

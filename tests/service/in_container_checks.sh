@@ -29,8 +29,19 @@ check "systemd-analyze verify is clean${verify:+: $verify}" [ -z "$verify" ]
 check "the socket listens" [ "$(systemctl is-active vitd_helper.socket)" = active ]
 check "the helper waits for its first client" [ "$(systemctl is-active vitd_helper.service)" != active ]
 
+check "the packages made the mobile account" getent passwd mobile
+check "the packages made the layout" [ "$(stat -c %U /private/var/mobile/Library/Preferences)" = mobile ] &&
+  [ -d /private/var/root/Library/Preferences ] && [ -d /private/var/logs ]
+expect 0 "vitdctl status: the socket listens, the helper is not started yet" $V status
+check "status names the socket unit and the logs" grep -q "vitd_helper.socket: active" /tmp/out &&
+  grep -q "journalctl -t vitd_helper" /tmp/out
+# The README's first command, on that stock layout.
 expect 0 "prepareWorkContainer starts the helper through the socket" \
   $V --timeout 20 prepareWorkContainer /private/var/VTRWorkContainer
+# The device's content the later commands work on.
+printf "<plist version=\"1.0\"><dict><key>DemoMode</key><true/></dict></plist>\n" \
+  > /private/var/root/Library/Preferences/com.orvane.Vitrell.plist
+mkdir -p /private/var/mobile/Media/DCIM && printf "a photo" > /private/var/mobile/Media/DCIM/IMG_0001.JPG
 pid=$(main_pid)
 check "the helper runs (pid $pid)" [ "$pid" -gt 0 ]
 status=$(cat /proc/"$pid"/status)
@@ -47,6 +58,8 @@ check "the helper has no network but loopback" \
   [ "$(awk -F: 'NR > 2 { gsub(/ /, "", $1); print $1 }' /proc/"$pid"/net/dev)" = lo ]
 
 expect 0 "migratePreferencesFile" $V migratePreferencesFile
+expect 1 "migratePreferencesFile again: nothing to move" $V migratePreferencesFile
+check "vitdctl says where the reason is" grep -q "journalctl -t vitd_helper -p err" /tmp/err
 check "the preferences file belongs to mobile" \
   [ "$(stat -c %U /private/var/mobile/Library/Preferences/com.orvane.Vitrell.plist)" = mobile ]
 mkdir -p /private/var/logs/demo
@@ -115,6 +128,10 @@ sleep 1  # journald receives asynchronously
 errors=$(journalctl --no-pager -o cat -t vitd_helper -p err)
 notices=$(journalctl --no-pager -o cat -t vitd_helper)
 check "a refusal is in the journal at error priority" grep -q "creating logs under /tmp/elsewhere is not allowed" <<<"$errors"
+check "a false answer's reason is in the journal at error priority" \
+  grep -q "^Nothing to move: /var/root/Library/Preferences/com.orvane.Vitrell.plist: No such file or directory" <<<"$errors"
+check "the journal names the command that answered false" grep -q "^migratePreferencesFile: answered NO for" <<<"$errors"
+check "the day file keeps only its own lines" bash -c '! grep -q "answered NO\|Nothing to move" /private/var/logs/vitd/vitd_helper-*.log'
 [ "$resize_error" = "^$" ] ||
   check "a failed resize is in the journal at error priority" grep -q "$resize_error" <<<"$errors"
 check "command entries are notices, not errors" bash -c '! grep -q "^Entering" <<<"$1" && grep -q "^Entering" <<<"$2"' _ "$errors" "$notices"

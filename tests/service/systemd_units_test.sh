@@ -48,7 +48,10 @@ mount -t overlay overlay -o "lowerdir=/,upperdir=$work/upper,workdir=$work/overl
 root=$work/root
 
 if [ ${#debs[@]} -eq 0 ]; then
-  # What the package's scripts do.
+  # What the package's scripts do: the shipped sysusers.d and tmpfiles.d
+  # snippets make the mobile account and the layout.
+  systemd-sysusers --root="$root" vitd.conf && systemd-tmpfiles --root="$root" --create vitd.conf ||
+    { echo "FAIL: applying the sysusers.d and tmpfiles.d snippets"; exit 1; }
   chroot "$root" /bin/sh -e -c '
     ldconfig
     groupadd --system vitd
@@ -90,15 +93,12 @@ else
   disk=
 fi
 
-# The device's accounts and data area.
+# A user of the vitd group. The mobile account and the data area's layout
+# are the packages' own (sysusers.d, tmpfiles.d, applied again at boot on
+# the data partition): the checks begin on that stock layout.
 chroot "$root" /bin/sh -e -c '
-  groupadd -g 501 mobile && useradd -u 501 -g 501 -d /var/mobile -M mobile
   useradd -M -G vitd demo
-  mkdir -p /private/var/root/Library/Preferences /private/var/mobile/Library/Preferences /private/var/logs
-  mkdir -p /private/var/mobile/Media/DCIM /usr/share/vitd/anchors/production
-  printf "<plist version=\"1.0\"><dict><key>DemoMode</key><true/></dict></plist>\n" \
-    > /private/var/root/Library/Preferences/com.orvane.Vitrell.plist
-  printf "a photo" > /private/var/mobile/Media/DCIM/IMG_0001.JPG
+  mkdir -p /usr/share/vitd/anchors/production
   systemctl mask systemd-firstboot.service systemd-networkd.service >/dev/null 2>&1 || true
 ' || { echo "FAIL: preparing the container's root"; exit 1; }
 cp "$here/in_container_checks.sh" "$root/root/checks.sh"

@@ -55,7 +55,10 @@ class LogCapture {
   LogCapture(const LogCapture&) = delete;
   LogCapture& operator=(const LogCapture&) = delete;
 
-  std::vector<std::string> messages() const { return log_->messages(); }
+  // What the day file would read: the journal's own explanations are left
+  // out (journalOnly() has them).
+  std::vector<std::string> messages() const { return log_->dayFileMessages(); }
+  std::vector<std::string> journalOnly() const { return log_->journalOnlyMessages(); }
   bool contains(const std::string& message) const { return log_->contains(message); }
   void clear() { log_->clear(); }
 
@@ -82,6 +85,10 @@ class TmpfsMount {
 
 // True when the tests run as root (ownership and mount tests need it).
 bool IsRoot();
+
+// Sets or clears the immutable flag of path (a file or directory); false
+// when the file system or the caller cannot.
+bool SetImmutable(const std::string& path, bool on);
 
 // Whether this build runs under the address sanitizer, which changes how
 // much memory a process takes.

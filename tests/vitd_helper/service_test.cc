@@ -163,11 +163,21 @@ TEST_F(ServiceTest, TheExampleClientAndVitdctlDriveTheHelperThroughTheClientLibr
   // vitdctl says why the second never comes.
   TempDir dir;
   WriteFile(dir / "request.json", R"({"prepareWorkContainer:": "/private/var/F", "zzz:": true})");
-  HelperSandbox::RunResult partial = vitdctl(VitdctlExecutable(), {"--label", "send", dir / "request.json"});
+  HelperSandbox::RunResult partial =
+      vitdctl(VitdctlExecutable(), {"--label", "send", "--raw", dir / "request.json"});
   EXPECT_EQ(partial.status, 75);
   EXPECT_EQ(partial.output, "prepareWorkContainer: {\"Response\":true}\n");
   EXPECT_NE(partial.errors.find("after 1 of 2 responses"), std::string::npos) << partial.errors;
   EXPECT_NE(partial.errors.find("a request key it does not know"), std::string::npos) << partial.errors;
+}
+
+TEST_F(ServiceTest, ASecondHelperOnTheSameRootNamesTheHelperInTheWay) {
+  HelperSandbox::RunResult second = sandbox_.run(HelperExecutable(), {"--root", sandbox_.root(), "--stderr"});
+  EXPECT_EQ(second.status, 1);
+  EXPECT_NE(second.errors.find("Could not create XPC listener.\nCannot listen: another helper is already listening on "
+                               "/run/com.orvane.vitrelldhelper.sock"),
+            std::string::npos)
+      << second.errors;
 }
 
 TEST_F(ServiceTest, ValuesOfOtherTypesAreLeftOut) {

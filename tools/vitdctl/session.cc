@@ -7,6 +7,8 @@
 #include <memory>
 #include <string>
 
+#include "tools/vitdctl/status.h"
+
 namespace vtr::vitdctl {
 namespace {
 
@@ -14,8 +16,10 @@ void DrawProgress(FILE* out, int64_t percent) {
   constexpr int kWidth = 40;
   const int64_t shown = percent < 0 ? 0 : (percent > 100 ? 100 : percent);
   const int filled = static_cast<int>(shown * kWidth / 100);
+  // The helper's percent may pass 100 (--json shows it as sent); the bar
+  // stops at full.
   std::fprintf(out, "\r[%s%s] %3lld%%", std::string(filled, '#').c_str(), std::string(kWidth - filled, '-').c_str(),
-               static_cast<long long>(percent));
+               static_cast<long long>(shown));
   std::fflush(out);
 }
 
@@ -83,7 +87,10 @@ int PrintMessage(const vitd_message* message, void* context) {
 int RunSession(const SessionOptions& options, const vitd_value& request, FILE* out) {
   vitd_client* client = nullptr;
   if (int status = vitd_connect(options.socketPath.c_str(), &client); status != VITD_OK) {
-    std::fprintf(stderr, "vitdctl: cannot connect to %s: %s\n", options.socketPath.c_str(), vitd_strerror(status));
+    const std::string reason = status == VITD_ERROR_CONNECT ? ConnectFailure(options.socketPath) : "";
+    std::fprintf(stderr, "vitdctl: cannot connect to %s: %s\n", options.socketPath.c_str(),
+                 reason.empty() ? vitd_strerror(status) : reason.c_str());
+    if (!options.howToStart.empty()) std::fprintf(stderr, "  %s\n", options.howToStart.c_str());
     return kExitUnavailable;
   }
   std::unique_ptr<vitd_client, void (*)(vitd_client*)> owned(client, vitd_disconnect);
@@ -108,7 +115,11 @@ int RunSession(const SessionOptions& options, const vitd_value& request, FILE* o
     if (status == VITD_ERROR_TIMEOUT || status == VITD_ERROR_CLOSED) ExplainSilence(state.responses);
     return kExitNoAnswer;
   }
-  return state.allTrue ? kExitOk : kExitNo;
+  if (state.allTrue) return kExitOk;
+  if (!options.whereReasonsAre.empty()) {
+    std::fprintf(stderr, "vitdctl: the helper answered false; why: %s\n", options.whereReasonsAre.c_str());
+  }
+  return kExitNo;
 }
 
 }  // namespace vtr::vitdctl

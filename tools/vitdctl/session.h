@@ -30,6 +30,11 @@ struct SessionOptions {
   // Start each line with the command it answers ("prepareWorkContainer: "):
   // the helper answers a request's keys in their order, one "Response" each.
   bool label = false;
+  // Said after a false answer: where the helper wrote why.
+  std::string whereReasonsAre;
+  // Said after a failed connection, after the system's reason: how to start
+  // the helper.
+  std::string howToStart;
 };
 
 // Sends request (a dictionary) and prints each message received as one line
