@@ -77,6 +77,29 @@ std::optional<Bytes> fileHashOfDescriptor(int fd, const std::string& path) {
   return digest;
 }
 
+std::optional<Bytes> copyHashing(int from, uint64_t size, int to) {
+  HashScratch& scratch = Scratch();
+  EVP_MD_CTX* context = scratch.context.get();
+  if (context == nullptr || EVP_DigestInit_ex(context, Sha1(), nullptr) != 1) return std::nullopt;
+  uint64_t written = 0;
+  const bool copied = ReadOnce(from, size, std::span<uint8_t>(scratch.chunk.get(), kFileHashChunkBytes),
+                               [&](std::span<const uint8_t> piece) {
+                                 if (TerminationRequested() ||
+                                     !WriteAllAt(to, piece, written) ||
+                                     EVP_DigestUpdate(context, piece.data(), piece.size()) != 1) {
+                                   return false;
+                                 }
+                                 written += piece.size();
+                                 return true;
+                               });
+  Bytes digest(kFileHashDigestBytes);
+  unsigned int length = 0;
+  if (!copied || EVP_DigestFinal_ex(context, digest.data(), &length) != 1 || length != digest.size()) {
+    return std::nullopt;
+  }
+  return digest;
+}
+
 std::optional<Bytes> directoryHash(const std::string&) { return std::nullopt; }
 
 }  // namespace vtr

@@ -41,6 +41,21 @@ bool ReadOnce(int fd, uint64_t size, std::span<uint8_t> buffer,
   return true;
 }
 
+bool WriteAllAt(int fd, std::span<const uint8_t> bytes, uint64_t offset) {
+  while (!bytes.empty()) {
+    const ssize_t n = ::pwrite(fd, bytes.data(), bytes.size(), static_cast<off_t>(offset));
+    if (n < 0 && errno == EINTR) continue;
+    if (n < 0) return false;
+    if (n == 0) {
+      errno = EIO;
+      return false;
+    }
+    bytes = bytes.subspan(static_cast<size_t>(n));
+    offset += static_cast<uint64_t>(n);
+  }
+  return true;
+}
+
 ssize_t ListExtendedAttributesOf(int fd, char* list, size_t size) { return ::flistxattr(fd, list, size); }
 
 ssize_t GetExtendedAttributeOf(int fd, const std::string& key, void* value, size_t size) {
@@ -60,12 +75,18 @@ int SetExtendedAttributeOf(int fd, const std::string& key, const void* value, si
   return ::fsetxattr(fd, key.c_str(), value, size, 0);
 }
 
+int RemoveExtendedAttributeOf(int fd, const std::string& key) { return ::fremovexattr(fd, key.c_str()); }
+
 int SetExtendedAttributeOfPath(const std::string& path, const std::string& key, const void* value, size_t size) {
   return ::lsetxattr(path.c_str(), key.c_str(), value, size, 0);
 }
 
-bool ChangeOwnerAt(int dirFd, const std::string& name, uid_t uid, gid_t gid) {
-  return ::fchownat(dirFd, name.c_str(), uid, gid, AT_SYMLINK_NOFOLLOW) == 0;
+UniqueFd OpenLinkItself(int dirFd, const std::string& name) {
+  return UniqueFd(::openat(dirFd, name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+}
+
+bool ChangeOwnerOfLink(int linkFd, uid_t uid, gid_t gid) {
+  return ::fchownat(linkFd, "", uid, gid, AT_EMPTY_PATH | AT_SYMLINK_NOFOLLOW) == 0;
 }
 
 uid_t ThisUser() { return ::geteuid(); }

@@ -48,6 +48,10 @@ bool StatOf(int fd, struct stat* st);
 bool ReadOnce(int fd, uint64_t size, std::span<uint8_t> buffer,
               const std::function<bool(std::span<const uint8_t>)>& consume);
 
+// Writes all of bytes to fd at offset (pwrite, EINTR retried); false,
+// errno set, on failure.
+bool WriteAllAt(int fd, std::span<const uint8_t> bytes, uint64_t offset);
+
 // flistxattr / fgetxattr of an open item.
 ssize_t ListExtendedAttributesOf(int fd, char* list, size_t size);
 ssize_t GetExtendedAttributeOf(int fd, const std::string& key, void* value, size_t size);
@@ -55,11 +59,19 @@ ssize_t GetExtendedAttributeOf(int fd, const std::string& key, void* value, size
 // fsetxattr of an open item, and lsetxattr of the item at path itself (a
 // link is not followed); 0, or -1 with errno.
 int SetExtendedAttributeOf(int fd, const std::string& key, const void* value, size_t size);
+// fremovexattr of an open item; 0, or -1 with errno.
+int RemoveExtendedAttributeOf(int fd, const std::string& key);
 int SetExtendedAttributeOfPath(const std::string& path, const std::string& key, const void* value, size_t size);
 
-// Gives name in dirFd (a link itself, not what it points to) to uid and gid;
-// false, errno set, on failure.
-bool ChangeOwnerAt(int dirFd, const std::string& name, uid_t uid, gid_t gid);
+// Opens the symbolic link name in dirFd itself (O_PATH, never followed),
+// so that what is done to it stays on that link whatever is swapped in
+// under its name; invalid, errno set, when it cannot be opened. The caller
+// checks that it is a link (StatOf).
+UniqueFd OpenLinkItself(int dirFd, const std::string& name);
+
+// Gives the link open as linkFd (OpenLinkItself) to uid and gid; false,
+// errno set, on failure.
+bool ChangeOwnerOfLink(int linkFd, uid_t uid, gid_t gid);
 
 // The effective user of this process, the owner of what it creates.
 uid_t ThisUser();

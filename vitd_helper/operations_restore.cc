@@ -7,6 +7,7 @@
 
 #include "model/log.h"
 #include "model/signed_manifest.h"
+#include "platform/accounts.h"
 #include "platform/open_beneath.h"
 #include "platform/read_fully.h"
 #include "vitd_helper/operations.h"
@@ -83,7 +84,12 @@ bool VTRHOperations::restoreAttributesUnder(const std::string& root, const std::
   }
   // Records are built here one at a time, in the order the manifest keeps
   // them, and laid down by workers on every core.
-  RestoreWorkers workers(stagingDir->get(), root, std::thread::hardware_concurrency());
+  // What is more than mobile's own is granted only after a check; without
+  // a mobile account, everything is.
+  const std::shared_ptr<const AccountDatabase> accounts = AccountDatabase::Shared();
+  const ClientAccount client{accounts->userId(paths_.mobileAccount).value_or(static_cast<uid_t>(-1)),
+                             accounts->groupId(paths_.mobileAccount).value_or(static_cast<gid_t>(-1))};
+  RestoreWorkers workers(stagingDir->get(), root, client, std::thread::hardware_concurrency());
   bool built = true;
   chosen->forEachEntry([&](const std::string& key, const PlistNode& node) {
     Result<Value> record = node.value();
