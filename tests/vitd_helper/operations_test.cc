@@ -35,6 +35,13 @@ std::string ReadLink(const std::string& path) {
   return n < 0 ? std::string() : std::string(target, static_cast<size_t>(n));
 }
 
+// A "VmHWM:" or "VmRSS:" figure of this process, in KiB.
+long StatusKiB(const std::string& field) {
+  const std::string status = ReadFile("/proc/self/status");
+  const size_t at = status.find(field);
+  return at == std::string::npos ? -1 : std::stol(status.substr(at + field.size()));
+}
+
 class OperationsTest : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -460,6 +467,39 @@ TEST_F(RestoreTest, PrivilegeGoesOnlyToTheSignedContentOnAnInodeNobodyElseHolds)
   EXPECT_EQ(Lstat(staging + "/d").st_mtim.tv_sec, 1000000000) << "once the copy beneath it is in place";
   EXPECT_EQ(Lstat(kept).st_uid, kMobile);
   EXPECT_EQ(Lstat(kept).st_mode & 06000, 0u);
+}
+
+TEST_F(RestoreTest, AManifestFileIsReadWithinItsSizeAndTheLimit) {
+  // A sparse file of 1 TiB, a binary one just over its limit, an XML one
+  // just over its own, a fifo: refused before anything is read, so the
+  // peak memory stays where it was.
+  const std::string big = host("/private/var/mobile/big.plist");
+  const struct {
+    const char* start;  // nullptr: a fifo
+    off_t size;
+  } cases[] = {
+      {"bplist00", off_t{1} << 40},
+      {"bplist00", (off_t{44} << 20) + 1},
+      {"<?xml", (off_t{12} << 20) + 1},
+      {nullptr, 0},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(::testing::Message() << (c.start != nullptr ? c.start : "fifo") << " " << c.size);
+    ::unlink(big.c_str());
+    if (c.start != nullptr) {
+      WriteFile(big, c.start);
+      ASSERT_EQ(::truncate(big.c_str(), c.size), 0);
+    } else {
+      ASSERT_EQ(::mkfifo(big.c_str(), 0644), 0);
+    }
+    WriteFile("/proc/self/clear_refs", "5");  // the peak starts again from here
+    const long before = StatusKiB("VmRSS:");
+    LogCapture log;
+    EXPECT_FALSE(ops_.restoreAttributesUnder("/private/var/staging", "/private/var/mobile/big.plist", std::nullopt,
+                                             std::nullopt));
+    EXPECT_EQ(log.messages().back(), "Cannot open manifest file.");
+    EXPECT_LT(StatusKiB("VmHWM:") - before, 8 * 1024);
+  }
 }
 
 TEST_F(RestoreTest, AManifestThatFailsItsCheckRestoresNothing) {
