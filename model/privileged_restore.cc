@@ -1,8 +1,8 @@
 // Privilege follows the signature: a record that makes a regular file
 // privileged is laid only onto content that hashes to the record's SHA-1,
-// on an inode the helper made, so that nothing the client still holds (a
-// writable descriptor, a shared mapping, another link) reaches what is
-// granted.
+// on an inode that a lease proves nobody can write or that the helper made
+// itself, so that nothing the client still holds (a writable descriptor, a
+// shared mapping, another link) reaches what is granted.
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -69,7 +69,7 @@ std::optional<bool> RestoreInPlace(const VTRFileMetadata& record, const Dictiona
   if (st.st_nlink != 1) return std::nullopt;
   WriterLease lease(item);
   if (!lease.held()) return std::nullopt;
-  const std::optional<Bytes> digest = fileHashOfDescriptor(item, path);
+  const std::optional<Bytes> digest = fileHashOfDescriptor(item, path, PageCache::kKeep);
   if (!digest) return false;
   if (*digest != *record.getHash()) {
     LogRefusal(path, "its content does not hash to the record's");

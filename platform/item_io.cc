@@ -25,8 +25,9 @@ bool StatAt(int dirFd, const std::string& name, struct stat* st) {
 bool StatOf(int fd, struct stat* st) { return ::fstat(fd, st) == 0; }
 
 bool ReadOnce(int fd, uint64_t size, std::span<uint8_t> buffer,
-              const std::function<bool(std::span<const uint8_t>)>& consume) {
-  ::posix_fadvise(fd, 0, 0, POSIX_FADV_SEQUENTIAL);
+              const std::function<bool(std::span<const uint8_t>)>& consume, PageCache cache) {
+  const bool drop = cache == PageCache::kDropBehind;
+  if (drop) ::posix_fadvise(fd, 0, 0, POSIX_FADV_SEQUENTIAL);
   uint64_t offset = 0;
   while (offset < size) {
     const size_t want = static_cast<size_t>(std::min<uint64_t>(size - offset, buffer.size()));
@@ -35,7 +36,7 @@ bool ReadOnce(int fd, uint64_t size, std::span<uint8_t> buffer,
     if (n < 0) return false;
     if (n == 0) return true;
     if (!consume(buffer.first(static_cast<size_t>(n)))) return false;
-    ::posix_fadvise(fd, static_cast<off_t>(offset), n, POSIX_FADV_DONTNEED);
+    if (drop) ::posix_fadvise(fd, static_cast<off_t>(offset), n, POSIX_FADV_DONTNEED);
     offset += static_cast<uint64_t>(n);
   }
   return true;

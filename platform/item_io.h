@@ -40,13 +40,19 @@ bool StatAt(int dirFd, const std::string& name, struct stat* st);
 // The status of an open file; false, errno set, on failure.
 bool StatOf(int fd, struct stat* st);
 
+// What a read does with the pages it brought into the cache.
+enum class PageCache {
+  kDropBehind,  // a scan of a whole device does not evict what the device was doing
+  kKeep,        // content about to be used (a restore's files)
+};
+
 // Reads the first size bytes of fd (fewer when it ends first) in pieces of
-// buffer's size, handing each to consume, and drops the pages read from the
-// cache again: a scan of a whole device does not evict what the device was
-// doing. EINTR is retried. False on a read error or when consume returns
-// false.
+// buffer's size, handing each to consume, and with kDropBehind drops the
+// pages read from the cache again. EINTR is retried. False on a read error
+// or when consume returns false.
 bool ReadOnce(int fd, uint64_t size, std::span<uint8_t> buffer,
-              const std::function<bool(std::span<const uint8_t>)>& consume);
+              const std::function<bool(std::span<const uint8_t>)>& consume,
+              PageCache cache = PageCache::kDropBehind);
 
 // Writes all of bytes to fd at offset (pwrite, EINTR retried); false,
 // errno set, on failure.
