@@ -11,9 +11,11 @@
 #define VTR_MODEL_FILE_HASH_H_
 
 #include <cstddef>
+#include <cstdint>
 #include <optional>
 #include <string>
 
+#include "platform/item_io.h"
 #include "platform/unique_fd.h"
 #include "platform/value.h"
 
@@ -48,7 +50,18 @@ UniqueFd OpenFileForHashAt(int dirFd, const std::string& name);
 // offset; fd stays the caller's. An invalid fd (the file could not be opened)
 // or one that is not a regular file logs "Cannot read file %@" (path), a
 // read error "Cannot read data from %@.".
-std::optional<Bytes> fileHashOfDescriptor(int fd, const std::string& path);
+// With PageCache::kKeep the pages read stay cached (a restore's files are
+// about to be used).
+std::optional<Bytes> fileHashOfDescriptor(int fd, const std::string& path,
+                                          PageCache cache = PageCache::kDropBehind);
+
+// Copies the first size bytes of the file open as from (fewer when it ends
+// first) to the start of the file open as to, and answers the digest of the
+// bytes written, hashed as they are written: when no other process can
+// reach `to`, the digest is that of its content. nullopt, errno set, on a
+// read or write error and when the helper is asked to terminate. Reads as
+// fileHashOfDescriptor does, the pages kept; logs nothing.
+std::optional<Bytes> copyHashing(int from, uint64_t size, int to);
 
 // Directories carry no hash: always nullopt, without touching the disk.
 std::optional<Bytes> directoryHash(const std::string& path);

@@ -36,6 +36,8 @@
 #ifndef VTR_MODEL_FILE_METADATA_H_
 #define VTR_MODEL_FILE_METADATA_H_
 
+#include <sys/types.h>
+
 #include <cstdint>
 #include <optional>
 #include <string>
@@ -63,6 +65,13 @@ enum VTRFileComparison : int {
   kVTRFileOwnershipDiffers = 4,
   kVTRFileExtendedAttributesDiffer = 5,
   kVTRFileSame = 6,
+};
+
+// The account that laid the content down (mobile): a restore may hand it
+// its own files freely; anything more is privilege.
+struct ClientAccount {
+  uid_t uid = static_cast<uid_t>(-1);
+  gid_t gid = static_cast<gid_t>(-1);
 };
 
 class VTRFileMetadata {
@@ -113,13 +122,29 @@ class VTRFileMetadata {
   // whether its extended attributes were set. This asymmetry is deliberate.
   bool restoreAttribuesToPath(const std::string& path) const;
   // The same onto the entry name of the open directory dirFd ("." for the
-  // directory itself), nothing resolved but that name and no link followed:
-  // a symbolic link gets its own owner and extended attributes; a regular
-  // file or directory is opened and set through its descriptor (a file with
-  // more than one link is never given to anyone but root); anything else fails
-  // the attributes step. path names the item in messages. dirFd stays the
-  // caller's.
-  bool restoreAttribuesToItemAt(int dirFd, const std::string& name, const std::string& path) const;
+  // directory itself), nothing resolved but that name and no link followed.
+  // path names the item in messages; dirFd stays the caller's.
+  // - A link record goes only onto a symbolic link, opened itself (O_PATH),
+  //   which gets its owner and extended attributes; anything else there
+  //   fails the attributes step.
+  // - A regular file or directory is opened and set through its
+  //   descriptor; its extended attributes go on before the immutable and
+  //   append-only flags, which are lifted first when it has them and set
+  //   last. A file with more than one link is never handed over to client
+  //   from another owner (the inode lives elsewhere too).
+  // - A record that leaves a regular file privileged (an owner or group
+  //   other than client's, a set-uid or set-gid bit, a "security."
+  //   extended attribute) is laid only onto the record's content (its
+  //   NSFileSize and its SHA-1 "VTRManifestFileHash", hashed from the
+  //   descriptor then changed), on an inode no one else can write: in place
+  //   when the file has one link and a read lease proves it has no writer,
+  //   else on a copy the helper makes beside it, which replaces it (mobile's
+  //   writable descriptors, mappings and other links keep reaching the old
+  //   inode). Otherwise "Not granting privilege to %@: %@" (path, why) and
+  //   NO, the item as it was.
+  // - Anything else fails the attributes step.
+  bool restoreAttribuesToItemAt(int dirFd, const std::string& name, const std::string& path,
+                                const ClientAccount& client) const;
 
   // The first difference from other, as a VTRFileComparison code: other
   // absent; type (an absent type here counts as different); content hash of

@@ -8,6 +8,7 @@
 
 #include "model/file_metadata.h"
 #include "model/log.h"
+#include "model/restore_steps.h"
 #include "platform/file_manager.h"
 #include "platform/file_tree.h"
 #include "platform/item_io.h"
@@ -134,22 +135,34 @@ bool VTRFileMetadata::restoreAttribuesToPath(const std::string& path) const {
   return attributesSet || extendedAttributesSet;
 }
 
-bool VTRFileMetadata::restoreAttribuesToItemAt(int dirFd, const std::string& name, const std::string& path) const {
+bool VTRFileMetadata::restoreAttribuesToItemAt(int dirFd, const std::string& name, const std::string& path,
+                                               const ClientAccount& client) const {
   const Dictionary* attributes = getFileAttributes();
   const std::string* type = getFileType();
   if (type != nullptr && *type == kNSFileTypeSymbolicLink) {
+    // Only a link gets a link record, through a descriptor of the link
+    // itself: a file put in its place (a hard link to another's file) is
+    // neither handed over nor given attributes.
+    UniqueFd link = OpenLinkItself(dirFd, name);
+    struct stat st;
+    if (!link || !StatOf(link.get(), &st) || !S_ISLNK(st.st_mode)) {
+      LogAttributesNotSet(path, link ? Error(EINVAL, path + " is not a symbolic link") : Error::FromErrno(path),
+                          attributes != nullptr ? *attributes : Dictionary());
+      return false;
+    }
     // A link's own owner; Linux gives links no mode. The result is not
     // checked, as on the platform.
-    (void)ChangeOwnerAt(dirFd, name, static_cast<uid_t>(Int32Attribute(attributes, kNSFileOwnerAccountID)),
-                        static_cast<gid_t>(Int32Attribute(attributes, kNSFileGroupOwnerAccountID)));
+    (void)ChangeOwnerOfLink(link.get(), static_cast<uid_t>(Int32Attribute(attributes, kNSFileOwnerAccountID)),
+                            static_cast<gid_t>(Int32Attribute(attributes, kNSFileGroupOwnerAccountID)));
     return SetExtendedAttributesWith(getExtendedAttributes(), path, [&](const std::string& key, const Bytes& data) {
-      return SetExtendedAttributeAt(dirFd, name, key, data.data(), data.size());
+      return SetExtendedAttributeOfLink(link.get(), dirFd, name, key, data.data(), data.size());
     });
   }
   static const Dictionary kNone;
   const Dictionary& all = attributes != nullptr ? *attributes : kNone;
   // Only a regular file or a directory is opened: a device's open could
-  // reach its driver, a fifo's block.
+  // reach its driver, a fifo's block. What is decided is decided on the
+  // opened item's own status.
   UniqueFd item;
   struct stat st;
   Status set = Status::Ok();
@@ -157,21 +170,46 @@ bool VTRFileMetadata::restoreAttribuesToItemAt(int dirFd, const std::string& nam
     set = Error::FromErrno(path);
   } else if (!S_ISREG(st.st_mode) && !S_ISDIR(st.st_mode)) {
     set = Error(S_ISLNK(st.st_mode) ? ELOOP : EOPNOTSUPP, path);
-  } else {
-    item = OpenAt(dirFd, name, kReadItemFlags);
-    set = item ? SetAttributesOfDescriptor(all, item.get(), path, kAllowedToSet) : Status(Error::FromErrno(path));
+  } else if (item = OpenAt(dirFd, name, kReadItemFlags); !item || !StatOf(item.get(), &st)) {
+    set = Error::FromErrno(path);
+  } else if (S_ISREG(st.st_mode) && GrantsPrivilege(*this, st, client)) {
+    return RestoreOntoVerifiedCopy(*this, dirFd, name, item.get(), st, path);
   }
-  if (!set.ok()) {
-    VTRLogError("Could not set file attributs at %@ with error - %@, attributes = %@", path, set.error(),
-           Value::DictionaryOf(fileAttributesAllowSet(all)));
+  // The extended attributes go on before the flags that would forbid them
+  // (lifted first when the item has them).
+  const Dictionary* extendedAttributes = getExtendedAttributes();
+  Result<std::optional<ItemFlags>> last =
+      set.ok() ? SetAttributesOfDescriptorExceptFlags(all, item.get(), path, AttributesAllowedToSet(),
+                                                      extendedAttributes != nullptr && !extendedAttributes->empty())
+               : Result<std::optional<ItemFlags>>(set.error());
+  if (!last.ok()) {
+    LogAttributesNotSet(path, last.error(), all);
     return false;
   }
   // The protection class has no Linux counterpart: setting it succeeds
-  // without effect, so its step cannot fail here.
-  SetExtendedAttributesWith(getExtendedAttributes(), path, [&item](const std::string& key, const Bytes& data) {
-    return SetExtendedAttributeOf(item.get(), key, data.data(), data.size());
-  });
+  // without effect, so its step cannot fail here. A failed extended
+  // attribute is logged and does not fail the record.
+  (void)SetRecordExtendedAttributesOf(extendedAttributes, item.get(), path);
+  if (*last) {
+    if (Status flagged = SetFlagsOfDescriptor(item.get(), **last, path); !flagged.ok()) {
+      LogAttributesNotSet(path, flagged.error(), all);
+      return false;
+    }
+  }
   return true;
+}
+
+std::span<const std::string_view> AttributesAllowedToSet() { return kAllowedToSet; }
+
+bool SetRecordExtendedAttributesOf(const Dictionary* extendedAttributes, int fd, const std::string& path) {
+  return SetExtendedAttributesWith(extendedAttributes, path, [fd](const std::string& key, const Bytes& data) {
+    return SetExtendedAttributeOf(fd, key, data.data(), data.size());
+  });
+}
+
+void LogAttributesNotSet(const std::string& path, const Error& error, const Dictionary& attributes) {
+  VTRLogError("Could not set file attributs at %@ with error - %@, attributes = %@", path, error,
+              Value::DictionaryOf(VTRFileMetadata::fileAttributesAllowSet(attributes)));
 }
 
 int VTRFileMetadata::compareWith(const VTRFileMetadata* other) const {

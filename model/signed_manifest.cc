@@ -19,6 +19,10 @@ constexpr char kCertificateBlock[] = "__49-[VTRSignedManifest createPublicKey:us
 // refused (no certificate to trust), an internal failure, and the trust
 // result of a chain that does not verify (a recoverable trust failure).
 constexpr long kStatusParameter = -50;
+// An XML payload is built whole, at about 3.5 times its size; beyond this it
+// would take a restore past its memory bound (a binary one is read in place).
+constexpr size_t kMaxXmlPayloadBytes = size_t{12} << 20;
+constexpr std::string_view kBinaryPlistMagic = "bplist";
 constexpr long kStatusInternal = -2070;
 constexpr long kResultRecoverableFailure = 5;
 
@@ -106,6 +110,12 @@ std::optional<VTRSignedManifest> VTRSignedManifest::Read(std::string bytes, cons
   if (contents->outer->format() == PlistFormat::kXml) {
     // The text is no longer needed: its values hold the decoded payload.
     contents->file = std::string();
+  }
+  const std::string_view payloadStart(reinterpret_cast<const char*>(contents->payloadBytes.data()),
+                                      std::min(contents->payloadBytes.size(), kBinaryPlistMagic.size()));
+  if (payloadStart != kBinaryPlistMagic && contents->payloadBytes.size() > kMaxXmlPayloadBytes) {
+    VTRLogError("%s: XML payload too large to read.", kInit);
+    return std::nullopt;
   }
   contents->payload = OpenDocument(contents->payloadBytes, kInit);
   if (!contents->payload) return std::nullopt;

@@ -13,8 +13,10 @@
 #ifndef VTR_PLATFORM_FILE_MANAGER_H_
 #define VTR_PLATFORM_FILE_MANAGER_H_
 
+#include <sys/stat.h>
 #include <sys/types.h>
 
+#include <optional>
 #include <span>
 #include <string>
 #include <string_view>
@@ -122,6 +124,43 @@ Status SetAttributes(const Dictionary& attributes, const std::string& path,
 // without a filtered copy).
 Status SetAttributesOfDescriptor(const Dictionary& attributes, int fd, const std::string& pathForErrors,
                                  std::span<const std::string_view> onlyKeys = {});
+
+// The flags that keep an item from changing.
+struct ItemFlags {
+  bool immutable = false;
+  bool appendOnly = false;
+  bool any() const { return immutable || appendOnly; }
+  friend bool operator==(const ItemFlags&, const ItemFlags&) = default;
+};
+
+// SetAttributesOfDescriptor without its last step, for a caller that changes
+// the item further (its extended attributes) before the flags forbid it:
+// flags the item has are lifted first when the attributes change the inode
+// or unlockForMore is set, and the flags to set last (with
+// SetFlagsOfDescriptor) are the answer; nullopt when they are to stay as
+// they are.
+Result<std::optional<ItemFlags>> SetAttributesOfDescriptorExceptFlags(const Dictionary& attributes, int fd,
+                                                                      const std::string& pathForErrors,
+                                                                      std::span<const std::string_view> onlyKeys,
+                                                                      bool unlockForMore);
+
+// Sets the immutable and append-only flags of the regular file or directory
+// open as fd (EOPNOTSUPP for another kind; the request would reach a
+// device's driver), and reads them.
+Status SetFlagsOfDescriptor(int fd, ItemFlags wanted, const std::string& pathForErrors);
+Result<ItemFlags> FlagsOfDescriptor(int fd, const std::string& pathForErrors);
+
+// Owner, group and mode (07777 bits) of the item whose status is current
+// once SetAttributesOfDescriptor(attributes, ..., onlyKeys) would have set
+// them; the attributes' values are checked as it checks them. A change of
+// owner that clears set-id bits is not counted: the answer errs towards more.
+struct ItemOwnership {
+  uid_t uid;
+  gid_t gid;
+  mode_t mode;
+};
+Result<ItemOwnership> OwnershipAfter(const Dictionary& attributes, const struct stat& current,
+                                     const std::string& pathForErrors, std::span<const std::string_view> onlyKeys);
 
 // Owner and group of the item at path itself (a symbolic link is changed,
 // not followed). An id of -1 leaves that one as it is.

@@ -18,14 +18,6 @@
 namespace vtr {
 namespace {
 
-// The file system flags SetAttributes manages.
-struct FileFlags {
-  bool immutable = false;
-  bool appendOnly = false;
-  bool any() const { return immutable || appendOnly; }
-  friend bool operator==(const FileFlags&, const FileFlags&) = default;
-};
-
 // What an attribute dictionary asks for, checked.
 struct AttributeChanges {
   std::optional<uid_t> owner;
@@ -134,16 +126,24 @@ Result<AttributeChanges> PlanChanges(const AttributeLookup& attributes, const st
   return changes;
 }
 
-FileFlags FlagsFromStatx(const struct statx& stx) {
+ItemFlags FlagsFromStatx(const struct statx& stx) {
   auto has = [&](uint64_t flag) { return (stx.stx_attributes_mask & flag) && (stx.stx_attributes & flag); };
-  return FileFlags{has(STATX_ATTR_IMMUTABLE), has(STATX_ATTR_APPEND)};
+  return ItemFlags{has(STATX_ATTR_IMMUTABLE), has(STATX_ATTR_APPEND)};
 }
 
-// Sets the flags of the regular file or directory open as fd (its type
-// checked before the ioctl: on a device the request would reach the driver).
-Status SetFlagsOfDescriptor(int fd, FileFlags wanted, const std::string& path) {
+// The same at path, opened without following a link and without blocking.
+Status SetFlags(const std::string& path, ItemFlags wanted) {
+  UniqueFd fd(::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+  if (!fd) return Error::FromErrno(path);
+  return SetFlagsOfDescriptor(fd.get(), wanted, path);
+}
+
+}  // namespace
+
+Status SetFlagsOfDescriptor(int fd, ItemFlags wanted, const std::string& path) {
   struct stat st;
   if (::fstat(fd, &st) != 0) return Error::FromErrno(path);
+  // On a device the request would reach the driver.
   if (!S_ISREG(st.st_mode) && !S_ISDIR(st.st_mode)) return Error(EOPNOTSUPP, path);
   int flags = 0;
   if (::ioctl(fd, FS_IOC_GETFLAGS, &flags) != 0) return Error::FromErrno(path);
@@ -153,14 +153,19 @@ Status SetFlagsOfDescriptor(int fd, FileFlags wanted, const std::string& path) {
   return Status::Ok();
 }
 
-// The same at path, opened without following a link and without blocking.
-Status SetFlags(const std::string& path, FileFlags wanted) {
-  UniqueFd fd(::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
-  if (!fd) return Error::FromErrno(path);
-  return SetFlagsOfDescriptor(fd.get(), wanted, path);
+Result<ItemFlags> FlagsOfDescriptor(int fd, const std::string& path) {
+  struct statx stx;
+  if (::statx(fd, "", AT_EMPTY_PATH, STATX_TYPE, &stx) != 0) return Error::FromErrno(path);
+  return FlagsFromStatx(stx);
 }
 
-}  // namespace
+Result<ItemOwnership> OwnershipAfter(const Dictionary& attributes, const struct stat& current,
+                                     const std::string& pathForErrors, std::span<const std::string_view> onlyKeys) {
+  Result<AttributeChanges> changes = PlanChanges(AttributeLookup{attributes, onlyKeys}, pathForErrors);
+  if (!changes.ok()) return changes.error();
+  return ItemOwnership{changes->owner.value_or(current.st_uid), changes->group.value_or(current.st_gid),
+                       changes->mode.value_or(current.st_mode & 07777)};
+}
 
 Status SetAttributes(const Dictionary& attributes, const std::string& path, LinkAtPath linkAtPath) {
   Result<AttributeChanges> changes = PlanChanges(AttributeLookup{attributes, {}}, path);
@@ -175,14 +180,14 @@ Status SetAttributes(const Dictionary& attributes, const std::string& path, Link
     return Error(ELOOP, path);
   }
 
-  FileFlags current = FlagsFromStatx(stx);
-  const FileFlags wanted{changes->immutable.value_or(current.immutable),
+  ItemFlags current = FlagsFromStatx(stx);
+  const ItemFlags wanted{changes->immutable.value_or(current.immutable),
                          changes->appendOnly.value_or(current.appendOnly)};
   // Immutable and append-only items refuse every other change.
   if (current.any() && changes->changesInode()) {
-    Status unlocked = SetFlags(path, FileFlags{});
+    Status unlocked = SetFlags(path, ItemFlags{});
     if (!unlocked.ok()) return unlocked;
-    current = FileFlags{};
+    current = ItemFlags{};
   }
   // Each call below refuses or stays on a link that was swapped in since
   // the statx above: nothing is followed.
@@ -203,12 +208,14 @@ Status SetAttributes(const Dictionary& attributes, const std::string& path, Link
   return Status::Ok();
 }
 
-Status SetAttributesOfDescriptor(const Dictionary& attributes, int fd, const std::string& pathForErrors,
-                                 std::span<const std::string_view> onlyKeys) {
+Result<std::optional<ItemFlags>> SetAttributesOfDescriptorExceptFlags(const Dictionary& attributes, int fd,
+                                                                      const std::string& pathForErrors,
+                                                                      std::span<const std::string_view> onlyKeys,
+                                                                      bool unlockForMore) {
   const std::string& path = pathForErrors;
   Result<AttributeChanges> changes = PlanChanges(AttributeLookup{attributes, onlyKeys}, path);
   if (!changes.ok()) return changes.error();
-  if (changes->empty()) return Status::Ok();
+  if (changes->empty() && !unlockForMore) return std::optional<ItemFlags>();
   struct statx stx;
   if (::statx(fd, "", AT_EMPTY_PATH, STATX_TYPE | STATX_MODE | STATX_NLINK | STATX_UID | STATX_GID | STATX_MTIME,
               &stx) != 0) {
@@ -232,12 +239,14 @@ Status SetAttributesOfDescriptor(const Dictionary& attributes, int fd, const std
   if (S_ISREG(stx.stx_mode) && stx.stx_nlink > 1 && handedOver) {
     return Error(EMLINK, path + " has more than one link and is never given another owner");
   }
-  FileFlags current = FlagsFromStatx(stx);
-  const FileFlags wanted{changes->immutable.value_or(current.immutable),
+  const ItemFlags current = FlagsFromStatx(stx);
+  const ItemFlags wanted{changes->immutable.value_or(current.immutable),
                          changes->appendOnly.value_or(current.appendOnly)};
-  if (current.any() && changes->changesInode()) {
-    if (Status unlocked = SetFlagsOfDescriptor(fd, FileFlags{}, path); !unlocked.ok()) return unlocked;
-    current = FileFlags{};
+  // Immutable and append-only items refuse every other change, the
+  // caller's too: the flags go last.
+  const bool unlock = current.any() && (changes->changesInode() || unlockForMore);
+  if (unlock) {
+    if (Status unlocked = SetFlagsOfDescriptor(fd, ItemFlags{}, path); !unlocked.ok()) return unlocked.error();
   }
   // Owner before mode: a change of owner clears the set-id bits.
   if ((changes->owner || changes->group) &&
@@ -249,7 +258,16 @@ Status SetAttributesOfDescriptor(const Dictionary& attributes, int fd, const std
     const struct timespec times[2] = {{0, UTIME_OMIT}, *changes->modificationTime};
     if (::futimens(fd, times) != 0) return Error::FromErrno(path);
   }
-  if (wanted != current) return SetFlagsOfDescriptor(fd, wanted, path);
+  if (wanted != (unlock ? ItemFlags{} : current)) return std::optional<ItemFlags>(wanted);
+  return std::optional<ItemFlags>();
+}
+
+Status SetAttributesOfDescriptor(const Dictionary& attributes, int fd, const std::string& pathForErrors,
+                                 std::span<const std::string_view> onlyKeys) {
+  Result<std::optional<ItemFlags>> last =
+      SetAttributesOfDescriptorExceptFlags(attributes, fd, pathForErrors, onlyKeys, false);
+  if (!last.ok()) return last.error();
+  if (*last) return SetFlagsOfDescriptor(fd, **last, pathForErrors);
   return Status::Ok();
 }
 

@@ -339,15 +339,24 @@ ssize_t GetExtendedAttributeAt(int dirFd, const std::string& name, const std::st
   return ::lgetxattr(fallbackPath->c_str(), key.c_str(), value, size);
 }
 
-int SetExtendedAttributeAt(int dirFd, const std::string& name, const std::string& key, const void* value,
-                           size_t size) {
-  if (size > UINT32_MAX) {
-    errno = E2BIG;
+int SetExtendedAttributeOfLink(int linkFd, int dirFd, const std::string& name, const std::string& key,
+                               const void* value, size_t size) {
+  // The descriptor's /proc entry leads to the link opened and stops there
+  // (setxattrat takes no O_PATH descriptor, and kernels before 6.13 lack
+  // it): the attribute lands on that inode on every kernel.
+  const std::string throughDescriptor = "/proc/self/fd/" + std::to_string(linkFd);
+  const int set = ::setxattr(throughDescriptor.c_str(), key.c_str(), value, size, 0);
+  if (set == 0 || errno != ENOENT) return set;
+  // No /proc (a chroot without it): the entry by name, not followed.
+  if (size > UINT32_MAX || xattrAtMissing.load(std::memory_order_relaxed)) {
+    errno = size > UINT32_MAX ? E2BIG : ENOSYS;
     return -1;
   }
   XattrArgs args{reinterpret_cast<uintptr_t>(value), static_cast<uint32_t>(size), 0};
-  return static_cast<int>(
-      ::syscall(SYS_setxattrat, dirFd, name.c_str(), AT_SYMLINK_NOFOLLOW, key.c_str(), &args, sizeof args));
+  const long n =
+      ::syscall(SYS_setxattrat, dirFd, name.c_str(), AT_SYMLINK_NOFOLLOW, key.c_str(), &args, sizeof args);
+  if (n < 0 && errno == ENOSYS) xattrAtMissing.store(true, std::memory_order_relaxed);
+  return static_cast<int>(n);
 }
 
 Status ReplicateItem(int srcDir, const std::string& srcName, int dstDir, const std::string& dstName,

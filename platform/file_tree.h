@@ -51,12 +51,15 @@ ssize_t GetExtendedAttributeAt(int dirFd, const std::string& name, const std::st
 // copy of it will need at least.
 Result<uint64_t> AllocatedBytesOfTree(int dirFd, const std::string& name, const std::string& pathForErrors);
 
-// Sets the extended attribute key of the entry name of dirFd itself, a
-// symbolic link there not followed (setxattrat, Linux 6.13): 0, or -1 with
-// errno (ENOSYS on older kernels, where nothing reaches a link's own
-// attributes without resolving a path again).
-int SetExtendedAttributeAt(int dirFd, const std::string& name, const std::string& key, const void* value,
-                           size_t size);
+// Sets the extended attribute key of the symbolic link open as linkFd
+// (O_PATH, OpenLinkItself), the entry name of dirFd, on the link itself:
+// through the descriptor's /proc/self/fd entry, which leads to the link
+// opened and stops there, so the attribute lands on that inode whatever
+// stands under its name now, on every kernel. Where /proc is missing (a
+// chroot), the entry name of dirFd, not followed (setxattrat, Linux 6.13;
+// ENOSYS before). 0, or -1 with errno.
+int SetExtendedAttributeOfLink(int linkFd, int dirFd, const std::string& name, const std::string& key,
+                               const void* value, size_t size);
 
 // How ReplicateItem makes the files of the copy.
 enum class Replication {

@@ -25,8 +25,9 @@ bool StatAt(int dirFd, const std::string& name, struct stat* st) {
 bool StatOf(int fd, struct stat* st) { return ::fstat(fd, st) == 0; }
 
 bool ReadOnce(int fd, uint64_t size, std::span<uint8_t> buffer,
-              const std::function<bool(std::span<const uint8_t>)>& consume) {
-  ::posix_fadvise(fd, 0, 0, POSIX_FADV_SEQUENTIAL);
+              const std::function<bool(std::span<const uint8_t>)>& consume, PageCache cache) {
+  const bool drop = cache == PageCache::kDropBehind;
+  if (drop) ::posix_fadvise(fd, 0, 0, POSIX_FADV_SEQUENTIAL);
   uint64_t offset = 0;
   while (offset < size) {
     const size_t want = static_cast<size_t>(std::min<uint64_t>(size - offset, buffer.size()));
@@ -35,7 +36,22 @@ bool ReadOnce(int fd, uint64_t size, std::span<uint8_t> buffer,
     if (n < 0) return false;
     if (n == 0) return true;
     if (!consume(buffer.first(static_cast<size_t>(n)))) return false;
-    ::posix_fadvise(fd, static_cast<off_t>(offset), n, POSIX_FADV_DONTNEED);
+    if (drop) ::posix_fadvise(fd, static_cast<off_t>(offset), n, POSIX_FADV_DONTNEED);
+    offset += static_cast<uint64_t>(n);
+  }
+  return true;
+}
+
+bool WriteAllAt(int fd, std::span<const uint8_t> bytes, uint64_t offset) {
+  while (!bytes.empty()) {
+    const ssize_t n = ::pwrite(fd, bytes.data(), bytes.size(), static_cast<off_t>(offset));
+    if (n < 0 && errno == EINTR) continue;
+    if (n < 0) return false;
+    if (n == 0) {
+      errno = EIO;
+      return false;
+    }
+    bytes = bytes.subspan(static_cast<size_t>(n));
     offset += static_cast<uint64_t>(n);
   }
   return true;
@@ -60,12 +76,18 @@ int SetExtendedAttributeOf(int fd, const std::string& key, const void* value, si
   return ::fsetxattr(fd, key.c_str(), value, size, 0);
 }
 
+int RemoveExtendedAttributeOf(int fd, const std::string& key) { return ::fremovexattr(fd, key.c_str()); }
+
 int SetExtendedAttributeOfPath(const std::string& path, const std::string& key, const void* value, size_t size) {
   return ::lsetxattr(path.c_str(), key.c_str(), value, size, 0);
 }
 
-bool ChangeOwnerAt(int dirFd, const std::string& name, uid_t uid, gid_t gid) {
-  return ::fchownat(dirFd, name.c_str(), uid, gid, AT_SYMLINK_NOFOLLOW) == 0;
+UniqueFd OpenLinkItself(int dirFd, const std::string& name) {
+  return UniqueFd(::openat(dirFd, name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+}
+
+bool ChangeOwnerOfLink(int linkFd, uid_t uid, gid_t gid) {
+  return ::fchownat(linkFd, "", uid, gid, AT_EMPTY_PATH | AT_SYMLINK_NOFOLLOW) == 0;
 }
 
 uid_t ThisUser() { return ::geteuid(); }

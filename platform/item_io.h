@@ -40,13 +40,23 @@ bool StatAt(int dirFd, const std::string& name, struct stat* st);
 // The status of an open file; false, errno set, on failure.
 bool StatOf(int fd, struct stat* st);
 
+// What a read does with the pages it brought into the cache.
+enum class PageCache {
+  kDropBehind,  // a scan of a whole device does not evict what the device was doing
+  kKeep,        // content about to be used (a restore's files)
+};
+
 // Reads the first size bytes of fd (fewer when it ends first) in pieces of
-// buffer's size, handing each to consume, and drops the pages read from the
-// cache again: a scan of a whole device does not evict what the device was
-// doing. EINTR is retried. False on a read error or when consume returns
-// false.
+// buffer's size, handing each to consume, and with kDropBehind drops the
+// pages read from the cache again. EINTR is retried. False on a read error
+// or when consume returns false.
 bool ReadOnce(int fd, uint64_t size, std::span<uint8_t> buffer,
-              const std::function<bool(std::span<const uint8_t>)>& consume);
+              const std::function<bool(std::span<const uint8_t>)>& consume,
+              PageCache cache = PageCache::kDropBehind);
+
+// Writes all of bytes to fd at offset (pwrite, EINTR retried); false,
+// errno set, on failure.
+bool WriteAllAt(int fd, std::span<const uint8_t> bytes, uint64_t offset);
 
 // flistxattr / fgetxattr of an open item.
 ssize_t ListExtendedAttributesOf(int fd, char* list, size_t size);
@@ -55,11 +65,19 @@ ssize_t GetExtendedAttributeOf(int fd, const std::string& key, void* value, size
 // fsetxattr of an open item, and lsetxattr of the item at path itself (a
 // link is not followed); 0, or -1 with errno.
 int SetExtendedAttributeOf(int fd, const std::string& key, const void* value, size_t size);
+// fremovexattr of an open item; 0, or -1 with errno.
+int RemoveExtendedAttributeOf(int fd, const std::string& key);
 int SetExtendedAttributeOfPath(const std::string& path, const std::string& key, const void* value, size_t size);
 
-// Gives name in dirFd (a link itself, not what it points to) to uid and gid;
-// false, errno set, on failure.
-bool ChangeOwnerAt(int dirFd, const std::string& name, uid_t uid, gid_t gid);
+// Opens the symbolic link name in dirFd itself (O_PATH, never followed),
+// so that what is done to it stays on that link whatever is swapped in
+// under its name; invalid, errno set, when it cannot be opened. The caller
+// checks that it is a link (StatOf).
+UniqueFd OpenLinkItself(int dirFd, const std::string& name);
+
+// Gives the link open as linkFd (OpenLinkItself) to uid and gid; false,
+// errno set, on failure.
+bool ChangeOwnerOfLink(int linkFd, uid_t uid, gid_t gid);
 
 // The effective user of this process, the owner of what it creates.
 uid_t ThisUser();

@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <cstdint>
 
 #include "platform/unique_fd.h"
 
@@ -29,6 +30,24 @@ Result<std::string> ReadFully(int fd, size_t limit) {
     if (text.size() + static_cast<size_t>(n) > limit) return Error(EFBIG, "more than the limit");
     text.append(chunk, static_cast<size_t>(n));
   }
+}
+
+Result<std::string> ReadRegularFile(int fd, size_t limit) {
+  struct stat st;
+  if (::fstat(fd, &st) != 0) return Error::FromErrno("fstat");
+  if (!S_ISREG(st.st_mode)) return Error(EINVAL, "not a regular file");
+  if (static_cast<uint64_t>(st.st_size) > limit) return Error(EFBIG, "more than the limit");
+  std::string bytes(static_cast<size_t>(st.st_size), '\0');
+  size_t done = 0;
+  while (done < bytes.size()) {
+    const ssize_t n = ::pread(fd, bytes.data() + done, bytes.size() - done, static_cast<off_t>(done));
+    if (n < 0 && errno == EINTR) continue;
+    if (n < 0) return Error::FromErrno("read");
+    if (n == 0) break;
+    done += static_cast<size_t>(n);
+  }
+  bytes.resize(done);
+  return bytes;
 }
 
 Result<std::string> ReadFileNamed(const std::string& path, size_t limit) {

@@ -15,6 +15,14 @@ namespace vtr {
 // read), or the read's errno; retries EINTR. fd stays the caller's.
 Result<std::string> ReadFully(int fd, size_t limit);
 
+// The bytes the regular file open as fd held when this was called: its size
+// is read once, a file over limit is refused (EFBIG) and one of another kind
+// (EINVAL) before anything is read, and nothing past that size is read
+// (a file that grows meanwhile gives its first bytes only; one that shrinks,
+// the bytes up to its end). One allocation of the size. fd stays the
+// caller's; its offset is not used.
+Result<std::string> ReadRegularFile(int fd, size_t limit);
+
 // The whole of the regular file (or pipe) at path (links followed: for the tools,
 // which read what their user names), at most limit bytes; "-" reads
 // standard input. Errors name the path.

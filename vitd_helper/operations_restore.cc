@@ -1,12 +1,14 @@
 // Attribute restoration: the records of a verified signed manifest laid onto
 // the content the unprivileged daemon put down.
 #include <fcntl.h>
-#include <sys/stat.h>
+#include <unistd.h>
 
+#include <cstring>
 #include <thread>
 
 #include "model/log.h"
 #include "model/signed_manifest.h"
+#include "platform/accounts.h"
 #include "platform/open_beneath.h"
 #include "platform/read_fully.h"
 #include "vitd_helper/failure_journal.h"
@@ -16,8 +18,25 @@
 namespace vtr {
 namespace {
 
-// Largest signed manifest read: a whole device's records with room to spare.
-constexpr size_t kMaxSignedManifestBytes = size_t{512} << 20;
+// Largest signed manifest read. The file is held whole while its records are
+// read from it in place, so it is what a restore's memory grows with: at
+// 44 MiB (about 120,000 records of a binary manifest, at some 360 bytes
+// each) the helper stays within 64 MiB plus 500 bytes per record whatever
+// the file holds (a hostile file of tiny objects costs a byte more per
+// object). An XML file is built whole, at about 3.5 times its size, so
+// its limit is lower. A larger file is refused before its bytes are read.
+constexpr size_t kMaxBinaryManifestBytes = size_t{44} << 20;
+constexpr size_t kMaxXmlManifestBytes = size_t{12} << 20;
+constexpr char kBinaryPlistMagic[] = "bplist";
+
+// The limit for the manifest open as fd, by the format its first bytes
+// announce.
+size_t ManifestLimit(int fd) {
+  char magic[sizeof kBinaryPlistMagic - 1] = {};
+  const bool binary = ::pread(fd, magic, sizeof magic, 0) == static_cast<ssize_t>(sizeof magic) &&
+                      std::memcmp(magic, kBinaryPlistMagic, sizeof magic) == 0;
+  return binary ? kMaxBinaryManifestBytes : kMaxXmlManifestBytes;
+}
 
 // The file manifest the container type and identifier select, or nullopt
 // after the message saying why not.
@@ -50,11 +69,8 @@ bool VTRHOperations::restoreAttributesUnder(const std::string& root, const std::
   Result<UniqueFd> folder = resolver_.openParent(*manifestFile);
   Result<UniqueFd> file = folder.ok() ? OpenEntryNoFollow(folder->get(), manifestFile->name(), O_RDONLY, manifestPath)
                                       : Result<UniqueFd>(folder.error());
-  struct stat st;
-  Result<std::string> bytes = Error(EINVAL, manifestPath);
-  if (file.ok() && ::fstat(file->get(), &st) == 0 && S_ISREG(st.st_mode)) {
-    bytes = ReadFully(file->get(), kMaxSignedManifestBytes);
-  }
+  Result<std::string> bytes = file.ok() ? ReadRegularFile(file->get(), ManifestLimit(file->get()))
+                                      : Result<std::string>(file.error());
   if (!bytes.ok()) {
     VTRLogError("Cannot open manifest file.");
     JournalFailure("Cannot read the signed manifest", manifestPath,
@@ -86,7 +102,12 @@ bool VTRHOperations::restoreAttributesUnder(const std::string& root, const std::
   }
   // Records are built here one at a time, in the order the manifest keeps
   // them, and laid down by workers on every core.
-  RestoreWorkers workers(stagingDir->get(), root, std::thread::hardware_concurrency());
+  // What is more than mobile's own is granted only after a check; without
+  // a mobile account, everything is.
+  const std::shared_ptr<const AccountDatabase> accounts = AccountDatabase::Shared();
+  const ClientAccount client{accounts->userId(paths_.mobileAccount).value_or(static_cast<uid_t>(-1)),
+                             accounts->groupId(paths_.mobileAccount).value_or(static_cast<gid_t>(-1))};
+  RestoreWorkers workers(stagingDir->get(), root, client, std::thread::hardware_concurrency());
   bool built = true;
   chosen->forEachEntry([&](const std::string& key, const PlistNode& node) {
     Result<Value> record = node.value();

@@ -1,6 +1,7 @@
 #include "vitd_helper/restore_workers.h"
 
 #include "model/file_metadata.h"
+#include "platform/file_manager.h"
 #include "platform/open_beneath.h"
 #include "platform/paths.h"
 #include "vitd_helper/client_path_resolver.h"
@@ -15,8 +16,8 @@ constexpr size_t kMaxQueuedBatches = 8;
 
 // Lays record onto the item key names beneath the staging root; false when
 // the record is no dictionary or cannot be laid.
-bool RestoreRecord(OpenDirectoryChain& directories, const std::string& root, const std::string& key,
-                   const Value& value) {
+bool RestoreRecord(OpenDirectoryChain& directories, const std::string& root, const ClientAccount& client,
+                   const std::string& key, const Value& value) {
   if (value.dictionary() == nullptr) return false;
   const VTRFileMetadata record(value);
   const std::string target = AppendPathComponent(root, key);
@@ -31,13 +32,22 @@ bool RestoreRecord(OpenDirectoryChain& directories, const std::string& root, con
     return false;
   }
   const std::string name = components->empty() ? "." : components->back();
-  return record.restoreAttribuesToItemAt(*parent, name, target);
+  return record.restoreAttribuesToItemAt(*parent, name, target, client);
+}
+
+// The modification date a directory record sets, or null for any other
+// record.
+const Value* DirectoryDate(const Value& record) {
+  const VTRFileMetadata metadata(record);
+  const std::string* type = metadata.getFileType();
+  if (type == nullptr || *type != kNSFileTypeDirectory) return nullptr;
+  return metadata.getFileAttributes()->find(kNSFileModificationDate);
 }
 
 }  // namespace
 
-RestoreWorkers::RestoreWorkers(int stagingDir, std::string root, unsigned workers)
-    : stagingDir_(stagingDir), root_(std::move(root)) {
+RestoreWorkers::RestoreWorkers(int stagingDir, std::string root, ClientAccount client, unsigned workers)
+    : stagingDir_(stagingDir), root_(std::move(root)), client_(client) {
   filling_.reserve(kBatchSize);
   for (unsigned i = 0; i < std::max(workers, 1u); ++i) threads_.emplace_back([this] { work(); });
 }
@@ -74,7 +84,24 @@ bool RestoreWorkers::finish() {
   changed_.notify_all();
   for (std::thread& thread : threads_) thread.join();
   threads_.clear();
-  return !failed_;
+  return !failed_ && setDirectoryDatesAgain();
+}
+
+bool RestoreWorkers::setDirectoryDatesAgain() {
+  OpenDirectoryChain directories(stagingDir_);
+  for (const auto& [key, date] : directoryDates_) {
+    const std::string target = AppendPathComponent(root_, key);
+    Result<std::vector<std::string>> components = SplitPathComponents("/" + key);
+    Result<int> directory = components.ok() ? directories.open(*components, components->size())
+                                            : Result<int>(components.error());
+    const Dictionary attributes({{kNSFileModificationDate, date}});
+    Status set = directory.ok() ? SetAttributesOfDescriptor(attributes, *directory, target) : directory.error();
+    if (!set.ok()) {
+      LogRefusal(target, set.error());
+      return false;
+    }
+  }
+  return true;
 }
 
 void RestoreWorkers::work() {
@@ -91,11 +118,15 @@ void RestoreWorkers::work() {
     changed_.notify_all();
     for (const auto& [key, record] : batch) {
       if (failed_.load(std::memory_order_relaxed)) return;
-      if (!RestoreRecord(directories, root_, key, record)) {
+      if (!RestoreRecord(directories, root_, client_, key, record)) {
         std::lock_guard lock(mutex_);
         failed_ = true;
         changed_.notify_all();
         return;
+      }
+      if (const Value* date = DirectoryDate(record)) {
+        std::lock_guard lock(mutex_);
+        directoryDates_.emplace_back(key, *date);
       }
     }
   }

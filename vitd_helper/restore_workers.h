@@ -6,10 +6,15 @@
 // keeps the directories of its last record open (OpenDirectoryChain), so
 // records in tree order cost few opens. Every record is resolved beneath
 // the staging root's descriptor without following links and laid onto the
-// item by descriptor (VTRFileMetadata::restoreAttribuesToItemAt). The first
+// item by descriptor (VTRFileMetadata::restoreAttribuesToItemAt): a record
+// that grants privilege copies and hashes its file there, so the workers
+// hash on every core while the caller reads the next records. The first
 // record that fails stops the run: workers take no record after it, add()
 // says so, and finish() answers false. Which other records were restored by
-// then is not defined. add() and finish() are called from one thread.
+// then is not defined. Once all are restored, finish() sets the
+// modification dates of the directories again (the copies put in place
+// beneath them changed them). add() and finish() are called from one
+// thread.
 #ifndef VTR_VITD_HELPER_RESTORE_WORKERS_H_
 #define VTR_VITD_HELPER_RESTORE_WORKERS_H_
 
@@ -22,6 +27,7 @@
 #include <utility>
 #include <vector>
 
+#include "model/file_metadata.h"
 #include "platform/value.h"
 
 namespace vtr {
@@ -29,9 +35,11 @@ namespace vtr {
 class RestoreWorkers {
  public:
   // stagingDir (the caller's, open for the workers' life) is the directory
-  // of root, the path messages name. At least one worker runs (workers 0,
-  // as hardware_concurrency() may answer, means one).
-  RestoreWorkers(int stagingDir, std::string root, unsigned workers);
+  // of root, the path messages name; client is the account that laid the
+  // content down (what is more than its own is verified first). At least
+  // one worker runs (workers 0, as hardware_concurrency() may answer, means
+  // one).
+  RestoreWorkers(int stagingDir, std::string root, ClientAccount client, unsigned workers);
   // Stops the workers after the queued records (as finish does).
   ~RestoreWorkers();
   RestoreWorkers(const RestoreWorkers&) = delete;
@@ -50,9 +58,14 @@ class RestoreWorkers {
 
   void work();
   void push(Batch batch);
+  // Sets the dates of the directories restored once more: putting copies
+  // in place beneath them changed them. False after the message when one
+  // cannot be set.
+  bool setDirectoryDatesAgain();
 
   const int stagingDir_;
   const std::string root_;
+  const ClientAccount client_;
   Batch filling_;
   std::mutex mutex_;
   std::condition_variable changed_;
@@ -60,6 +73,7 @@ class RestoreWorkers {
   bool closed_ = false;
   std::atomic<bool> failed_{false};
   std::vector<std::thread> threads_;
+  std::vector<std::pair<std::string, Value>> directoryDates_;  // key, date; under mutex_
 };
 
 }  // namespace vtr

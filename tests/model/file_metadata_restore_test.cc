@@ -1,5 +1,8 @@
 // Laying a file metadata record onto an item, and comparing two records.
 #include <fcntl.h>
+#include <linux/fs.h>
+#include <sys/ioctl.h>
+#include <sys/syscall.h>
 #include <sys/stat.h>
 #include <sys/xattr.h>
 #include <unistd.h>
@@ -8,8 +11,11 @@
 
 #include <gtest/gtest.h>
 
+#include "model/file_hash.h"
 #include "model/file_metadata.h"
 #include "platform/file_manager.h"
+#include "platform/unique_fd.h"
+#include "tests/support/failing_syscall.h"
 #include "tests/support/file_inspection.h"
 #include "tests/support/test_support.h"
 
@@ -154,6 +160,78 @@ TEST(RestoreAttributesTest, ALinkRecordChangesTheLinkItself) {
   EXPECT_EQ(Lstat(dir / "link").st_uid, 601u);
   EXPECT_EQ(Lstat(dir / "link").st_gid, 602u);
   EXPECT_EQ(Lstat(dir / "file").st_uid, 0u) << "the link was followed";
+}
+
+// A record of an immutable file with extended attributes, laid twice onto
+// the same file (the second time over the flag the first set): handed to
+// its owner, made root's in place under a lease, and made root's on a
+// verified copy where no lease can be had (no CAP_LEASE).
+TEST(RestoreAttributesTest, AnImmutableFileTakesItsExtendedAttributesEveryTime) {
+  if (!IsRoot()) GTEST_SKIP() << "flags need CAP_LINUX_IMMUTABLE";
+  TempDir dir;
+  WriteFile(dir / "f", "content");
+  UniqueFd folder(::open(dir.path().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  const ClientAccount client{501, 501};
+  const Bytes sha1 = *fileHash(dir / "f");
+  const struct {
+    uid_t owner;
+    bool lease;
+  } variants[] = {{501, true}, {0, true}, {0, false}};
+  for (const auto [owner, lease] : variants) {
+    SCOPED_TRACE(::testing::Message() << owner << (lease ? " leased" : " copied"));
+    ASSERT_EQ(::chown((dir / "f").c_str(), 501, 501), 0);
+    Parts parts;
+    parts.hash = Value::Data(sha1);
+    parts.attributes = {{kNSFileOwnerAccountID, Value::Integer(owner)},
+                        {kNSFileGroupOwnerAccountID, Value::Integer(owner)},
+                        {kNSFilePosixPermissions, Value::Integer(0644)},
+                        {kNSFileImmutable, Value::Boolean(true)}};
+    for (const char* value : {"2", "3"}) {
+      parts.xattrs = Value::DictionaryOf({{"trusted.a", DataOf("1")}, {"user.b", DataOf(value)}});
+      LogCapture log;
+      const auto restore = [&] {
+        return std::string(parts.record().restoreAttribuesToItemAt(folder.get(), "f", dir / "f", client) ? "YES" : "NO");
+      };
+      EXPECT_EQ(lease ? restore() : testing::RunWithFailingSyscalls({SYS_fcntl}, EPERM, restore), "YES") << value;
+      EXPECT_TRUE(log.messages().empty()) << log.messages().front();
+      EXPECT_EQ(Xattr(dir / "f", "trusted.a"), "1");
+      EXPECT_EQ(Xattr(dir / "f", "user.b"), value);
+      EXPECT_EQ(Lstat(dir / "f").st_uid, owner);
+    }
+    // Set by both passes; cleared for the next owner.
+    UniqueFd file(::open((dir / "f").c_str(), O_RDONLY | O_CLOEXEC));
+    int flags = 0;
+    ASSERT_EQ(::ioctl(file.get(), FS_IOC_GETFLAGS, &flags), 0);
+    EXPECT_TRUE(flags & FS_IMMUTABLE_FL);
+    flags &= ~FS_IMMUTABLE_FL;
+    ASSERT_EQ(::ioctl(file.get(), FS_IOC_SETFLAGS, &flags), 0);
+  }
+}
+
+// Extended attributes of a link go onto the link, on kernels with
+// setxattrat and on those without.
+TEST(RestoreAttributesTest, ALinkTakesItsExtendedAttributesOnEveryKernel) {
+  if (!IsRoot() || !testing::CanFailSyscalls()) GTEST_SKIP() << "trusted attributes need root";
+  TempDir dir;
+  WriteFile(dir / "file", "x");
+  UniqueFd folder(::open(dir.path().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  Parts parts;
+  parts.type = kNSFileTypeSymbolicLink;
+  parts.attributes = {{kNSFileOwnerAccountID, Value::Integer(0)}, {kNSFileGroupOwnerAccountID, Value::Integer(0)}};
+  parts.xattrs = Value::DictionaryOf({{"trusted.v", DataOf("1")}});
+  const long kSetXattrAt = 463;
+  for (const char* link : {"now", "before-6.13"}) {
+    ASSERT_EQ(::symlink("file", (dir / link).c_str()), 0);
+    const auto restore = [&] {
+      return parts.record().restoreAttribuesToItemAt(folder.get(), link, dir / link, ClientAccount{501, 501})
+                 ? Xattr(dir / link, "trusted.v")
+                 : "NO";
+    };
+    EXPECT_EQ(link == std::string("now") ? restore() : testing::RunWithFailingSyscalls({kSetXattrAt}, ENOSYS, restore),
+              "1")
+        << link;
+    EXPECT_EQ(Xattr(dir / "file", "trusted.v"), "<none>") << "followed";
+  }
 }
 
 TEST(CompareRecordsTest, ReportsTheFirstDifference) {

@@ -220,7 +220,7 @@ TEST(FileMetadataTest, OnlySettableAttributesAreRestored) {
                                                      })}}));
   UniqueFd folder(::open(dir.path().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   LogCapture log;
-  EXPECT_TRUE(record.restoreAttribuesToItemAt(folder.get(), "f", dir / "f")) << ::testing::PrintToString(log.messages());
+  EXPECT_TRUE(record.restoreAttribuesToItemAt(folder.get(), "f", dir / "f", ClientAccount{0, 0})) << ::testing::PrintToString(log.messages());
   struct stat st;
   ASSERT_EQ(::stat((dir / "f").c_str(), &st), 0);
   EXPECT_EQ(st.st_mode & 07777, 0604u);

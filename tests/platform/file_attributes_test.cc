@@ -5,12 +5,15 @@
 #include <sys/ioctl.h>
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
 
 #include "platform/accounts.h"
 #include "platform/file_manager.h"
+#include "platform/unique_fd.h"
+#include "platform/writer_lease.h"
 #include "tests/support/file_inspection.h"
 #include "tests/support/test_support.h"
 
@@ -274,6 +277,32 @@ TEST(SetAttributesTest, ImmutableFlagIsSetLastAndLiftedForOtherChanges) {
   ASSERT_EQ(::mknod((dir / "chr").c_str(), S_IFCHR | 0600, ::makedev(1, 3)), 0);
   EXPECT_EQ(SetAttributes(Dictionary({{kNSFileImmutable, Value::Boolean(true)}}), dir / "chr").error().code(),
             EOPNOTSUPP);
+}
+
+// A lease is not granted beside a writer, and shows one that comes while it
+// is held (the writer waits until it is released).
+TEST(WriterLeaseTest, ProvesThatNoOneCanWrite) {
+  TempDir dir;
+  WriteFile(dir / "f", "x");
+  UniqueFd reader(::open((dir / "f").c_str(), O_RDONLY | O_CLOEXEC));
+  {
+    UniqueFd writer(::open((dir / "f").c_str(), O_RDWR | O_CLOEXEC));
+    EXPECT_FALSE(WriterLease(reader.get()).held());
+  }
+  pid_t child = -1;
+  {
+    WriterLease lease(reader.get());
+    ASSERT_TRUE(lease.held());
+    EXPECT_TRUE(lease.stillAlone());
+    child = ::fork();
+    if (child == 0) _exit(::open((dir / "f").c_str(), O_WRONLY) >= 0 ? 0 : 1);
+    bool seen = false;
+    for (int i = 0; i < 500 && !seen; ++i) seen = !lease.stillAlone() || ::usleep(10000) != 0;
+    EXPECT_TRUE(seen) << "the waiting writer went unseen";
+  }
+  int status = 0;
+  ASSERT_EQ(::waitpid(child, &status, 0), child);
+  EXPECT_EQ(status, 0);
 }
 
 }  // namespace

@@ -8,8 +8,10 @@
 #include <fstream>
 
 #include <gtest/gtest.h>
+#include <openssl/evp.h>
 
 #include "model/file_metadata.h"
+#include "platform/file_manager.h"
 #include "platform/format.h"
 #include "platform/plist.h"
 #include "platform/unique_fd.h"
@@ -243,8 +245,8 @@ TEST(RestoreMemoryTest, ManyRecordsAreRestoredWithinTheMemoryBound) {
   WriteFile(staging + "/template", "");
   const Value model = VTRFileMetadata::initWithPath(staging + "/template")->dict();
 
-  // The content as the daemon laid it (mobile's); the records say root's,
-  // each with a hash of its own.
+  // The content as the daemon laid it (mobile's), each file its own key;
+  // the records say root's, so each file is copied and hashed.
   DictionaryBuilder records;
   for (int d = 0; d < kDirectories; ++d) {
     const std::string directory = Format("/d%03d", d);
@@ -252,10 +254,24 @@ TEST(RestoreMemoryTest, ManyRecordsAreRestoredWithinTheMemoryBound) {
     for (int f = 0; f < kFilesEach; ++f) {
       const std::string key = Format("%s/f%04d", directory, f);
       UniqueFd file(::open((staging + key).c_str(), O_CREAT | O_WRONLY | O_CLOEXEC, 0600));
-      ASSERT_TRUE(file && ::fchown(file.get(), kMobileUid, kMobileGid) == 0) << key;
+      ASSERT_TRUE(file && ::write(file.get(), key.data(), key.size()) == static_cast<ssize_t>(key.size()) &&
+                  ::fchown(file.get(), kMobileUid, kMobileGid) == 0)
+          << key;
       DictionaryBuilder record;
       for (const auto& [name, value] : *model.dictionary()) {
-        record.add(name, name == kVTRManifestFileHash ? Value::Data(key.data(), 20) : value);
+        if (name == kVTRManifestFileHash) {
+          Bytes sha1(20);
+          ASSERT_EQ(EVP_Digest(key.data(), key.size(), sha1.data(), nullptr, EVP_sha1(), nullptr), 1);
+          record.add(name, Value::Data(std::move(sha1)));
+        } else if (name == kVTRManifestFileAttributes) {
+          DictionaryBuilder attributes;
+          for (const auto& [attribute, setting] : *value.dictionary()) {
+            attributes.add(attribute, attribute == kNSFileSize ? Value::Unsigned(key.size()) : setting);
+          }
+          record.add(name, attributes.build());
+        } else {
+          record.add(name, value);
+        }
       }
       records.add(key, record.build());
     }

@@ -6,10 +6,12 @@
 #include <fcntl.h>
 #include <linux/fs.h>
 #include <sys/ioctl.h>
+#include <sys/mman.h>
 #include <sys/stat.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstdlib>
 
 #include <gtest/gtest.h>
@@ -24,11 +26,20 @@ namespace vtr::testing {
 namespace {
 
 constexpr uid_t kMobile = 501;
+// A file capability (revision 2, effective): CAP_NET_BIND_SERVICE permitted.
+constexpr char kCapability[20] = {0x01, 0, 0, 0x02, 0, 0x04};
 
 std::string ReadLink(const std::string& path) {
   char target[4096];
   const ssize_t n = ::readlink(path.c_str(), target, sizeof target);
   return n < 0 ? std::string() : std::string(target, static_cast<size_t>(n));
+}
+
+// A "VmHWM:" or "VmRSS:" figure of this process, in KiB.
+long StatusKiB(const std::string& field) {
+  const std::string status = ReadFile("/proc/self/status");
+  const size_t at = status.find(field);
+  return at == std::string::npos ? -1 : std::stol(status.substr(at + field.size()));
 }
 
 class OperationsTest : public ::testing::Test {
@@ -287,9 +298,14 @@ class RestoreTest : public OperationsTest {
     ASSERT_EQ(::utimensat(AT_FDCWD, (demo + "/d/f").c_str(), old, 0), 0);
     WriteFile(demo + "/d/g", "g");
     ::chmod((demo + "/d/g").c_str(), 04755);
+    WriteFile(demo + "/d/c", "c");
+    ASSERT_EQ(::setxattr((demo + "/d/c").c_str(), "security.capability", kCapability, sizeof kCapability, 0), 0);
     WriteFile(demo + "/d/m", "m");
     ASSERT_EQ(::chown((demo + "/d/m").c_str(), kMobile, kMobile), 0);
     ASSERT_EQ(::symlink("f", (demo + "/d/l").c_str()), 0);
+    ASSERT_EQ(::symlink("m", (demo + "/d/ml").c_str()), 0);
+    ASSERT_EQ(::lchown((demo + "/d/ml").c_str(), kMobile, kMobile), 0);
+    ASSERT_EQ(::utimensat(AT_FDCWD, (demo + "/d").c_str(), old, 0), 0);
     ASSERT_TRUE(ops_.createDeviceManifest("/private/var/mobile/Demo", true));
     Result<Value> manifest = ReadPropertyListFile(host("/private/var/VTRWorkContainer/DeviceManifest.plist"));
     ASSERT_TRUE(manifest.ok());
@@ -306,12 +322,15 @@ class RestoreTest : public OperationsTest {
     LayDown();
   }
 
-  // The content as the daemon lays it: mobile's, plain modes, no attributes.
+  // The content as the daemon lays it: the recorded bytes (mobile's own
+  // file's differ), mobile's, plain modes, no attributes.
   void LayDown() {
     const std::string staging = host("/private/var/staging");
     ASSERT_EQ(std::system(("rm -rf '" + staging + "' && mkdir -p '" + staging + "/d'").c_str()), 0);
-    for (const char* file : {"/d/f", "/d/g", "/d/m"}) WriteFile(staging + file, "x");
+    for (const char* file : {"f", "g", "c"}) WriteFile(staging + "/d/" + file, file);
+    WriteFile(staging + "/d/m", "x");
     ASSERT_EQ(::symlink("f", (staging + "/d/l").c_str()), 0);
+    ASSERT_EQ(::symlink("m", (staging + "/d/ml").c_str()), 0);
     ASSERT_EQ(std::system(("chown -hR 501:501 '" + staging + "'").c_str()), 0);
   }
 
@@ -325,6 +344,7 @@ TEST_F(RestoreTest, EveryRecordIsLaidOntoTheContent) {
   const std::string staging = host("/private/var/staging");
   EXPECT_EQ(Lstat(staging + "/d").st_mode & 07777, 0750u);
   EXPECT_EQ(Lstat(staging + "/d").st_uid, 0u);
+  EXPECT_EQ(Lstat(staging + "/d").st_mtim.tv_sec, 1000000000) << "once the copies beneath it are in place";
   const struct stat f = Lstat(staging + "/d/f");
   EXPECT_EQ(f.st_mode & 07777, 0640u);
   EXPECT_EQ(f.st_uid, 0u);
@@ -334,6 +354,7 @@ TEST_F(RestoreTest, EveryRecordIsLaidOntoTheContent) {
   EXPECT_EQ(Lstat(staging + "/d/g").st_mode & 07777, 04755u) << "set-id bits survive the change of owner";
   EXPECT_EQ(Lstat(staging + "/d/m").st_uid, kMobile);
   EXPECT_EQ(Lstat(staging + "/d/l").st_uid, 0u) << "a link gets its own owner";
+  EXPECT_EQ(Xattr(staging + "/d/c", "security.capability"), std::string(kCapability, sizeof kCapability));
   EXPECT_EQ(Lstat(staging).st_mode & 07777, 0755u) << "the tree itself is the record \"/\"";
 }
 
@@ -389,9 +410,96 @@ TEST_F(RestoreTest, NothingOutsideTheStagingRootChangesThroughWhatTheClientPlant
   ASSERT_EQ(::link(host("/private/var/dbfile").c_str(), host("/private/var/staging/d/m").c_str()), 0);
   EXPECT_FALSE(Restore());
   EXPECT_EQ(Lstat(host("/private/var/dbfile")).st_uid, 0u);
+  // The same where mobile's link was recorded: only a link takes a link
+  // record.
+  LayDown();
+  ASSERT_EQ(::unlink(host("/private/var/staging/d/ml").c_str()), 0);
+  ASSERT_EQ(::link(host("/private/var/dbfile").c_str(), host("/private/var/staging/d/ml").c_str()), 0);
+  EXPECT_FALSE(Restore());
+  EXPECT_EQ(Lstat(host("/private/var/dbfile")).st_uid, 0u);
   // Paths the client sends are client paths.
   EXPECT_FALSE(ops_.restoreAttributesUnder("/etc", "/private/var/mobile/m.plist", std::nullopt, std::nullopt));
   EXPECT_FALSE(ops_.restoreAttributesUnder("/private/var/staging", "/private/var/root/m.plist", std::nullopt, std::nullopt));
+}
+
+TEST_F(RestoreTest, PrivilegeGoesOnlyToTheSignedContentOnAnInodeNobodyElseHolds) {
+  const std::string staging = host("/private/var/staging");
+  // Mobile's own bytes where a set-uid file or a file capability was
+  // signed: refused, the file left mobile's.
+  const struct {
+    const char* file;
+    const char* content;
+    const char* why;
+  } swapped[] = {
+      {"g", "#", "its content does not hash to the record's"},
+      {"g", "#!/bin/sh\nexec /bin/sh -p\n", "its size is not the record's"},
+      {"c", "#", "its content does not hash to the record's"},
+  };
+  for (const auto& c : swapped) {
+    LayDown();
+    const std::string path = staging + "/d/" + c.file;
+    WriteFile(path, c.content);
+    LogCapture log;
+    EXPECT_FALSE(Restore()) << c.file << " " << c.content;
+    const std::string line = std::string("Not granting privilege to /private/var/staging/d/") + c.file + ": " + c.why;
+    EXPECT_NE(std::find(log.messages().begin(), log.messages().end(), line), log.messages().end()) << line;
+    EXPECT_EQ(Lstat(path).st_uid, kMobile);
+    EXPECT_EQ(Lstat(path).st_mode & 06000, 0u);
+    EXPECT_EQ(Xattr(path, "security.capability"), "<none>");
+  }
+  // The signed bytes, with a writable descriptor, a shared writable mapping
+  // and a second link that mobile keeps: none reaches the restored file.
+  LayDown();
+  const std::string g = staging + "/d/g";
+  const std::string kept = host("/private/var/mobile/kept");
+  ASSERT_EQ(::link(g.c_str(), kept.c_str()), 0);
+  UniqueFd writable(::open(g.c_str(), O_RDWR | O_CLOEXEC));
+  void* mapped = ::mmap(nullptr, 1, PROT_READ | PROT_WRITE, MAP_SHARED, writable.get(), 0);
+  ASSERT_NE(mapped, MAP_FAILED);
+  ASSERT_TRUE(Restore());
+  ASSERT_EQ(::pwrite(writable.get(), "w", 1, 0), 1);
+  static_cast<char*>(mapped)[0] = 'm';
+  ::munmap(mapped, 1);
+  EXPECT_EQ(ReadFile(g), "g");
+  const struct stat restored = Lstat(g);
+  EXPECT_EQ(restored.st_mode & 07777, 04755u);
+  EXPECT_EQ(restored.st_nlink, 1u);
+  EXPECT_EQ(Lstat(staging + "/d").st_mtim.tv_sec, 1000000000) << "once the copy beneath it is in place";
+  EXPECT_EQ(Lstat(kept).st_uid, kMobile);
+  EXPECT_EQ(Lstat(kept).st_mode & 06000, 0u);
+}
+
+TEST_F(RestoreTest, AManifestFileIsReadWithinItsSizeAndTheLimit) {
+  // A sparse file of 1 TiB, a binary one just over its limit, an XML one
+  // just over its own, a fifo: refused before anything is read, so the
+  // peak memory stays where it was.
+  const std::string big = host("/private/var/mobile/big.plist");
+  const struct {
+    const char* start;  // nullptr: a fifo
+    off_t size;
+  } cases[] = {
+      {"bplist00", off_t{1} << 40},
+      {"bplist00", (off_t{44} << 20) + 1},
+      {"<?xml", (off_t{12} << 20) + 1},
+      {nullptr, 0},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(::testing::Message() << (c.start != nullptr ? c.start : "fifo") << " " << c.size);
+    ::unlink(big.c_str());
+    if (c.start != nullptr) {
+      WriteFile(big, c.start);
+      ASSERT_EQ(::truncate(big.c_str(), c.size), 0);
+    } else {
+      ASSERT_EQ(::mkfifo(big.c_str(), 0644), 0);
+    }
+    WriteFile("/proc/self/clear_refs", "5");  // the peak starts again from here
+    const long before = StatusKiB("VmRSS:");
+    LogCapture log;
+    EXPECT_FALSE(ops_.restoreAttributesUnder("/private/var/staging", "/private/var/mobile/big.plist", std::nullopt,
+                                             std::nullopt));
+    EXPECT_EQ(log.messages().back(), "Cannot open manifest file.");
+    EXPECT_LT(StatusKiB("VmHWM:") - before, 8 * 1024);
+  }
 }
 
 TEST_F(RestoreTest, AManifestThatFailsItsCheckRestoresNothing) {

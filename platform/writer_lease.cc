@@ -1,0 +1,23 @@
+#include "platform/writer_lease.h"
+
+#include <fcntl.h>
+#include <signal.h>
+
+namespace vtr {
+
+WriterLease::WriterLease(int fd) {
+  if (::fcntl(fd, F_SETSIG, SIGURG) != 0) return;
+  if (::fcntl(fd, F_SETLEASE, F_RDLCK) != 0) return;
+  fd_ = fd;
+}
+
+WriterLease::~WriterLease() {
+  if (fd_ >= 0) ::fcntl(fd_, F_SETLEASE, F_UNLCK);
+}
+
+bool WriterLease::stillAlone() const {
+  // A lease being broken reads as the type it is going to: unlocked.
+  return fd_ >= 0 && ::fcntl(fd_, F_GETLEASE) == F_RDLCK;
+}
+
+}  // namespace vtr
