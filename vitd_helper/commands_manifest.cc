@@ -33,10 +33,12 @@ bool VTRHMessageResponder::restoreAttributes(const Value& parameter) {
   // A missing type or identifier (a null is never carried over) is nil: the
   // whole device. Container types are compared as strings, so one that is
   // present but no string names no container, and neither does such an
-  // identifier: the request fails rather than reach the whole device.
+  // identifier: the request fails rather than reach the whole device, even
+  // when the other of the two is missing.
   const Value type = parameter.get("ContentType");
   const Value identifier = parameter.get("Identifier");
-  if (!type.isNil() && !identifier.isNil() && (type.string() == nullptr || identifier.string() == nullptr)) {
+  const auto presentButNoString = [](const Value& value) { return !value.isNil() && value.string() == nullptr; };
+  if (presentButNoString(type) || presentButNoString(identifier)) {
     VTRLogError("Couldn't load manifest dict for %@/%@", type, identifier);
     return false;
   }

@@ -51,7 +51,8 @@ TEST(ResponderTest, AContainerTypeOrIdentifierThatIsNoStringNamesNoManifest) {
   } cases[] = {
       {XpcObject::Int64(5), XpcObject::String("com.example"), "Couldn't load manifest dict for 5/com.example"},
       {XpcObject::String("AppData"), XpcObject::Int64(5), "Couldn't load manifest dict for AppData/5"},
-      {XpcObject::Null(), XpcObject::Int64(5), nullptr},
+      {XpcObject::Null(), XpcObject::Int64(5), "Couldn't load manifest dict for (null)/5"},
+      {XpcObject::Null(), XpcObject::String("com.example"), nullptr},
   };
   for (const auto& c : cases) {
     LogCapture log;
