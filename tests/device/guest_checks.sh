@@ -4,7 +4,7 @@
 # with vitdctl. Reports on the second serial port, one line a fact:
 #   @@ NAME rc=STATUS s=SECONDS    a step: a command, or a check (rc 0 = held)
 #   @@ NAME VALUE                  a value for the test to compare
-# The phase (first, second, cut-resize, cut-move, after-cut, grow) is in the
+# The phase (first, second; cut-resize, cut-move, after-cut; grow) is in the
 # file "phase" next to this script.
 set -u
 here=$(dirname "$0")
@@ -19,7 +19,10 @@ step() {
   "$@" > /tmp/step.out 2>&1
   rc=$?
   echo "@@ $name rc=$rc s=$(awk -v a="$started" -v b="$EPOCHREALTIME" 'BEGIN { printf "%.2f", b - a }')"
-  [ $rc -eq 0 ] || sed 's/^/   | /' /tmp/step.out | tail -n 15
+  if [ $rc -ne 0 ]; then
+    sed 's/^/   | /' /tmp/step.out | tail -n 15
+    journalctl -t vitd_helper -p err -n 5 -o cat | sed 's/^/   journal: /'
+  fi
 }
 value() { echo "@@ $1 $2"; }
 helper_pid() { systemctl show -p MainPID --value vitd_helper.service; }
@@ -34,12 +37,30 @@ fs_bytes() {
 }
 sizes() { value "$1-partition" "$(partition_bytes)"; value "$1-fs" "$(fs_bytes)"; }
 gpt_valid() { sgdisk -v /dev/rdisk0s1 | grep -q '^No problems found'; }
-# The final content as owner, mode and extended attribute of each file.
-content() { (cd "$1" && find . -type f | sort | while read -r f; do
-  echo "$f $(stat -c '%U:%G %a' "$f") $(getfattr --only-values -n user.vitd.origin "$f" 2>/dev/null)"; done) | md5sum | cut -c1-12; }
+# A tree's files with owner and mode, and their user.* extended attributes
+# (one at most a file), as one digest; "none" without the tree.
+content() {
+  [ -d "$1" ] || { echo none; return; }
+  (cd "$1" && find . -type f -printf '%p %u:%g %m\n' | sort && getfattr -R -d -m user. . 2>/dev/null | grep . | paste - - | sort) |
+    md5sum | cut -c1-12
+}
+# Prints "@@ cut-now" when the helper logs a line that starts with $1: the
+# test cuts the power then.
+cut_at() {
+  journalctl -f -n 0 -t vitd_helper -o cat | while read -r line; do
+    case $line in "$1"*) echo "@@ cut-now" ;; esac
+  done &
+  sleep 2
+}
+after_cut() {
+  step gpt-valid gpt_valid
+  step data-mounted findmnt /private/var
+  sizes after-cut
+  value final-content "$(content $final)"
+}
 
 value phase "$phase"
-value boot "$(systemd-analyze time 2>/dev/null | sed -n 's/^Startup finished in //p')"
+value uptime "$(cut -d' ' -f1 /proc/uptime)"
 value boot-disk "$(readlink -f /dev/rdisk0s1)"
 
 case $phase in
@@ -53,7 +74,8 @@ first)
   mkdir -p /private/var/logs/demo
   step log-container vitdctl prepareLogContainer /private/var/logs/demo
   step device-manifest vitdctl createDeviceManifest /private/var
-  step manifest-progress grep -q '"Progress"' /tmp/step.out
+  cp /tmp/step.out /tmp/manifest.out
+  step manifest-progress grep -q '"Progress"' /tmp/manifest.out
   step manifest-written test -s /private/var/VTRWorkContainer/DeviceManifest.plist
 
   # The content and its signed manifest, then attributes gone wrong.
@@ -62,22 +84,25 @@ first)
   chown -R mobile:mobile $media && chmod 0640 $media/Album/*.JPG
   setfattr -n user.vitd.origin -v camera $media/Album/IMG_0002.JPG
   value content-recorded "$(content $media)"
-  vtr-manifest create $media -o /tmp/media.plist > /dev/null &&
+  vtr-manifest create $media -o /tmp/media.plist > /dev/null 2>&1 &&
     vtr-manifest sign /tmp/media.plist --key "$here/signer.key" --certificate "$here/signer.pem" \
-      -o /private/var/mobile/signed.plist > /dev/null
-  chown root:root $media/Album/IMG_0001.JPG && chmod 0600 $media/Album/*.JPG
+      -o /private/var/mobile/signed.plist > /dev/null 2>&1
+  chmod 0600 $media/Album/*.JPG
   setfattr -x user.vitd.origin $media/Album/IMG_0002.JPG
 
   step staging-container vitdctl prepareWorkContainer /private/var/staging
   step hard-link vitdctl createHardLink $media /private/var/staging/Media
   step staged-is-same-inode \
     test "$(stat -c %i $media/Album/IMG_0003.JPG)" = "$(stat -c %i /private/var/staging/Media/Album/IMG_0003.JPG)"
+  # A file of more than one link never changes owner; one left with a
+  # single link gets its owner back.
+  rm $media/Album/IMG_0001.JPG && chown root:root /private/var/staging/Media/Album/IMG_0001.JPG
   step restore-attributes vitdctl restoreAttributes /private/var/staging/Media /private/var/mobile/signed.plist
   step move-to-final vitdctl moveStagingToFinal /private/var/staging
   value content-final "$(content $final/Media)"
 
   step write-variable vitdctl writeNvram VtrDevice "written on the first boot"
-  value variable-in-efivarfs "$(tail -c +5 $variable)"
+  value variable-in-efivarfs "$(cat $variable | tail -c +5)"
   sizes before-shrink
   step shrink vitdctl --timeout 300 shrinkDataPartition
   sizes after-shrink
@@ -88,7 +113,7 @@ first)
   echo "@@ still-running"
   ;;
 second)
-  value variable-in-efivarfs "$(tail -c +5 $variable)"
+  value variable-in-efivarfs "$(cat $variable | tail -c +5)"
   step gpt-valid gpt_valid
   sizes after-reboot
   value content-final "$(content $final/Media)"
@@ -109,6 +134,43 @@ second)
   step a-new-helper test "$(helper_pid)" -gt 0 -a "$(helper_pid)" != "$pid"
   journalctl --sync
   echo "@@ done"
+  systemctl poweroff
+  ;;
+cut-resize)
+  sizes before-cut
+  cut_at "shrinking HFS filesystem"
+  vitdctl --timeout 300 shrinkDataPartition
+  echo "@@ not-cut"
+  ;;
+cut-move)
+  after_cut
+  # Old content in the final place, new content in staging; many files, so
+  # that the move takes a while.
+  mkdir -p $final/Media /private/var/staging/Media
+  (cd $final/Media && seq -f old%g 4000 | xargs touch)
+  (cd /private/var/staging/Media && seq -f new%g 4000 | xargs touch && chown mobile *1)
+  value old-content "$(content $final)"
+  value new-content "$(content /private/var/staging)"
+  sync
+  # The cut comes once the old content is being removed.
+  (while [ "$(ls $final/Media 2>/dev/null | wc -l)" -ge 4000 ]; do :; done; echo "@@ cut-now") &
+  vitdctl --timeout 300 moveStagingToFinal /private/var/staging
+  echo "@@ not-cut"
+  ;;
+after-cut)
+  after_cut
+  value staging-content "$(content /private/var/staging)"
+  systemctl poweroff
+  ;;
+grow)
+  # ext4 grows online (the helper needs CAP_SYS_RESOURCE for it) but cannot
+  # shrink.
+  sizes before-grow
+  step shrink vitdctl --timeout 300 shrinkDataPartition
+  step expand vitdctl --timeout 300 expandDataPartition
+  sizes after-grow
+  step gpt-valid gpt_valid
+  step data-mounted findmnt /private/var
   systemctl poweroff
   ;;
 esac

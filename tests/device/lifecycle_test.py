@@ -61,22 +61,25 @@ def missing_requirement():
     return None
 
 
-def build_image():
+def build_image(data_fs="btrfs"):
     started = time.monotonic()
-    out = subprocess.run([os.path.join(TREE, "scripts", "device"), "build"], capture_output=True, text=True)
+    out = subprocess.run([os.path.join(TREE, "scripts", "device"), "build", "--data-fs", data_fs],
+                         capture_output=True, text=True)
     if out.returncode != 0:
         raise AssertionError(f"scripts/device build failed:\n{out.stderr[-4000:]}")
-    print(f"image: {time.monotonic() - started:.1f} s (scripts/device build)\n{out.stderr.strip()}", flush=True)
+    print(f"image ({data_fs}): {time.monotonic() - started:.1f} s (scripts/device build) {out.stderr.strip()}",
+          flush=True)
     return out.stdout.strip().splitlines()[-1]
 
 
 class Boot:
     """What one boot reported on the second serial port."""
 
-    def __init__(self, run, report, console):
+    def __init__(self, run, report, console, boot_seconds):
         self.run = run
         self.report = report
         self.console = console
+        self.boot_seconds = boot_seconds  # from power-on until the checks started
 
     def steps(self):
         return {name: (int(rc), float(s)) for name, rc, s in
@@ -139,9 +142,16 @@ class Device:
             "-drive", f"if=none,id=checks,format=raw,readonly=on,file={self._checks_disk(phase)}",
             "-device", "virtio-blk-pci,drive=checks,serial=vitd-checks",
             "-serial", f"file:{console}", "-serial", f"file:{report}"]
-        watch = (lambda: cut_power(read(report))) if cut_power else None
+        started = time.monotonic()
+        checks_started = []
+
+        def watch():
+            text = read(report)
+            if not checks_started and "@@ phase" in text:
+                checks_started.append(time.monotonic() - started)
+            return cut_power is not None and cut_power(text)
         run = qemu_vm.run(arguments, self.folder, BOOT_TIMEOUT, watch)
-        return Boot(run, read(report), read(console))
+        return Boot(run, read(report), read(console), checks_started[0] if checks_started else None)
 
     def firmware_store_holds(self, name, value):
         """Whether the variable store file holds name (UTF-16) and then value."""
@@ -160,9 +170,10 @@ def read(path):
 
 
 def print_times(label, boot):
-    times = ", ".join(f"{name} {s:.1f}" for name, (_, s) in boot.steps().items() if s >= 0.05)
-    print(f"{label}: {boot.run.seconds:.1f} s in QEMU (systemd: {boot.value('boot')}); "
-          f"steps over 0.05 s: {times}", flush=True)
+    times = ", ".join(f"{name} {s:.2f}" for name, (_, s) in boot.steps().items() if s >= 0.05)
+    booted = f"{boot.boot_seconds:.1f}" if boot.boot_seconds else "?"
+    print(f"{label}: {boot.run.seconds:.1f} s in QEMU, up after {booted} s (kernel uptime {boot.value('uptime')} s); "
+          f"steps: {times}", flush=True)
 
 
 class LifeCycleTest(unittest.TestCase):
@@ -209,6 +220,49 @@ class LifeCycleTest(unittest.TestCase):
             self.assertIn("@@ done", second.report, second.context())
             self.assertEqual(second.run.reason, "guest-shutdown", second.context())
 
+    def test_power_cut_during_a_resize_and_a_move(self):
+        """The power fails while the helper shrinks the data file system, then
+        while it moves staging to the final place: each time the next boot
+        finds a valid table, a mounted data volume, and the old or the new
+        content whole."""
+        image = build_image()
+        with tempfile.TemporaryDirectory(prefix="vitd-device.", dir="/var/tmp") as folder:
+            device = Device(folder, image)
+            cut_now = lambda report: "@@ cut-now" in report  # noqa: E731
+            resize = device.boot("cut-resize", cut_now)
+            print(f"cut during the resize: {resize.run.seconds:.1f} s", flush=True)
+            self.assertTrue(resize.run.power_cut, resize.context())
+
+            move = device.boot("cut-move", cut_now)
+            print_times("after the cut during the resize, cut during the move", move)
+            self.assert_steps(move, ["gpt-valid", "data-mounted"])
+            self.assertLessEqual(move.number("after-cut-fs"), move.number("after-cut-partition"), move.context())
+            self.assertLessEqual(move.number("after-cut-partition"), resize.number("before-cut-partition"))
+            self.assertTrue(move.run.power_cut, move.context())
+
+            after = device.boot("after-cut")
+            print_times("after the cut during the move", after)
+            self.assert_steps(after, ["gpt-valid", "data-mounted"])
+            # The old content is removed before the new is moved in: cut in
+            # between, the new content is whole where it was staged.
+            final, staging = after.value("final-content"), after.value("staging-content")
+            whole = {move.value("old-content"): "old", move.value("new-content"): "new"}
+            self.assertTrue(final in whole or staging == move.value("new-content"), after.context())
+            print(f"after the cut: the final place holds {whole.get(final, 'part of the old')} content, "
+                  f"staging {'the new content' if staging != 'none' else 'nothing'}", flush=True)
+
+    def test_ext4_grows_online(self):
+        """An ext4 data partition with free blocks behind it: the confined
+        helper grows it while mounted, and refuses to shrink it."""
+        image = build_image("ext4")
+        with tempfile.TemporaryDirectory(prefix="vitd-device.", dir="/var/tmp") as folder:
+            grow = Device(folder, image).boot("grow")
+            print_times("ext4 growth", grow)
+            self.assertEqual(grow.steps().get("shrink", (None,))[0], 1, grow.context())
+            self.assert_steps(grow, ["expand", "gpt-valid", "data-mounted"])
+            self.assertGreater(grow.number("after-grow-partition"), grow.number("before-grow-partition"))
+            self.assertEqual(grow.number("after-grow-fs"), grow.number("after-grow-partition"), grow.context())
+
 
 if __name__ == "__main__":
     why = missing_requirement()
@@ -216,6 +270,6 @@ if __name__ == "__main__":
         print(f"SKIPPED: the device test cannot run here: {why}")
         sys.exit(qemu_vm.SKIP)
     started = time.monotonic()
-    result = unittest.main(argv=sys.argv[:1], exit=False).result
+    result = unittest.main(argv=sys.argv, exit=False).result
     print(f"device test: {time.monotonic() - started:.1f} s")
     sys.exit(0 if result.wasSuccessful() else 1)
