@@ -238,6 +238,8 @@ class LifeCycleTest(unittest.TestCase):
             self.assert_steps(move, ["gpt-valid", "data-mounted"])
             self.assertLessEqual(move.number("after-cut-fs"), move.number("after-cut-partition"), move.context())
             self.assertLessEqual(move.number("after-cut-partition"), resize.number("before-cut-partition"))
+            print(f"after the cut during the resize: partition {resize.number('before-cut-partition')} -> "
+                  f"{move.number('after-cut-partition')} bytes, file system {move.number('after-cut-fs')}", flush=True)
             self.assertTrue(move.run.power_cut, move.context())
 
             after = device.boot("after-cut")
