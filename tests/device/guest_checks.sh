@@ -44,14 +44,6 @@ content() {
   (cd "$1" && find . -type f -printf '%p %u:%g %m\n' | sort && getfattr -R -d -m user. . 2>/dev/null | grep . | paste - - | sort) |
     md5sum | cut -c1-12
 }
-# Prints "@@ cut-now" when the helper logs a line that starts with $1: the
-# test cuts the power then.
-cut_at() {
-  journalctl -f -n 0 -t vitd_helper -o cat | while read -r line; do
-    case $line in "$1"*) echo "@@ cut-now" ;; esac
-  done &
-  sleep 2
-}
 after_cut() {
   step gpt-valid gpt_valid
   step data-mounted findmnt /private/var
@@ -137,10 +129,16 @@ second)
   systemctl poweroff
   ;;
 cut-resize)
+  # Data high on the volume: the shrink moves it, which takes seconds.
+  dd if=/dev/zero of=/private/var/fill-1 bs=1M count=250 status=none
+  dd if=/dev/zero of=/private/var/fill-2 bs=1M count=150 status=none
+  rm /private/var/fill-1 && sync
   sizes before-cut
-  cut_at "shrinking HFS filesystem"
-  vitdctl --timeout 300 shrinkDataPartition
+  systemctl start vitd_helper.service
+  echo "@@ cut-soon"
+  step shrink vitdctl --timeout 300 shrinkDataPartition
   echo "@@ not-cut"
+  systemctl poweroff
   ;;
 cut-move)
   after_cut
@@ -156,6 +154,7 @@ cut-move)
   (while [ "$(ls $final/Media 2>/dev/null | wc -l)" -ge 4000 ]; do :; done; echo "@@ cut-now") &
   vitdctl --timeout 300 moveStagingToFinal /private/var/staging
   echo "@@ not-cut"
+  systemctl poweroff
   ;;
 after-cut)
   after_cut
