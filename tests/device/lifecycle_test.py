@@ -25,6 +25,7 @@ import io
 import os
 import re
 import shutil
+import signal
 import subprocess
 import sys
 import tarfile
@@ -279,6 +280,8 @@ if __name__ == "__main__":
     if why:
         print(f"SKIPPED: the device test cannot run here: {why}")
         sys.exit(qemu_vm.SKIP)
+    # Stopped (a test timeout), it still removes its files; QEMU dies with it.
+    signal.signal(signal.SIGTERM, lambda *_: sys.exit(1))
     started = time.monotonic()
     result = unittest.main(argv=sys.argv, exit=False).result
     print(f"device test: {time.monotonic() - started:.1f} s")

@@ -1,9 +1,11 @@
 """One run of a QEMU virtual machine on UEFI firmware, watched through its
 monitor (QMP): how the guest ended it ("guest-reset", "guest-shutdown"), or
 that the power was cut (the process killed) when the caller asked."""
+import ctypes
 import json
 import os
 import shutil
+import signal
 import socket
 import subprocess
 import time
@@ -39,6 +41,11 @@ class Run:
         self.power_cut = power_cut
 
 
+def _die_with_parent():
+    """QEMU is killed when the test dies, whatever kills it."""
+    ctypes.CDLL(None, use_errno=True).prctl(1, signal.SIGKILL)  # PR_SET_PDEATHSIG
+
+
 def _connect(path, qemu):
     for _ in range(200):
         monitor = socket.socket(socket.AF_UNIX)
@@ -63,7 +70,8 @@ def run(arguments, folder, timeout, cut_power=None):
         os.remove(qmp_path)
     command = [QEMU] + arguments + ["-qmp", f"unix:{qmp_path},server=on,wait=off"]
     started = time.monotonic()
-    qemu = subprocess.Popen(command, stdin=subprocess.DEVNULL, stdout=subprocess.DEVNULL, stderr=subprocess.PIPE)
+    qemu = subprocess.Popen(command, stdin=subprocess.DEVNULL, stdout=subprocess.DEVNULL, stderr=subprocess.PIPE,
+                            preexec_fn=_die_with_parent)
     reason = None
     power_cut = False
     try:
