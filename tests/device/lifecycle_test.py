@@ -116,7 +116,8 @@ class Device:
         subprocess.run(["openssl", "req", "-newkey", "rsa:2048", "-nodes", "-subj", "/CN=Device Test Signer",
                         "-keyout", key, "-out", csr], check=True, capture_output=True)
         subprocess.run(["openssl", "x509", "-req", "-sha256", "-days", "2", "-in", csr, "-CA",
-                        os.path.join(ca, "ca.pem"), "-CAkey", os.path.join(ca, "ca.key"), "-CAcreateserial",
+                        os.path.join(ca, "ca.pem"), "-CAkey", os.path.join(ca, "ca.key"),
+                        "-set_serial", str(int.from_bytes(os.urandom(8), "big")),
                         "-out", pem], check=True, capture_output=True)
         return key, pem
 
