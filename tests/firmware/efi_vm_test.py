@@ -22,22 +22,19 @@ import json
 import os
 import re
 import shutil
-import socket
 import subprocess
 import sys
 import tempfile
-import time
 import unittest
 
 HERE = os.path.dirname(os.path.abspath(__file__))
+sys.path.insert(0, os.path.join(HERE, "..", "support"))
+import qemu_vm  # noqa: E402
+
 BIN = sys.argv[1] if len(sys.argv) > 1 else os.path.join(HERE, "..", "..", "build", "bin")
 CACHE = os.environ.get("VTR_VM_CACHE", "/var/cache/vitd-tests")
 KERNEL_DIR = os.path.join(CACHE, "kernel")
-OVMF_CODE = "/usr/share/OVMF/OVMF_CODE_4M.fd"
-OVMF_VARS = "/usr/share/OVMF/OVMF_VARS_4M.fd"
-QEMU = shutil.which("qemu-system-x86_64")
 BUSYBOX = shutil.which("busybox")
-SKIP = 77
 BOOT_TIMEOUT = 240  # seconds; a boot takes about 10 s under software emulation
 GUID = "da3c1531-e7a2-45a1-875c-5c2980f00b0d"
 
@@ -96,14 +93,13 @@ poweroff -f
 
 def missing_requirement():
     """Why the test cannot run here, or None."""
-    for path, why in ((QEMU, "qemu-system-x86_64 (apt-get install qemu-system-x86)"),
-                      (BUSYBOX, "busybox (apt-get install busybox-static)"),
+    why = qemu_vm.missing_qemu()
+    if why:
+        return why
+    for path, why in ((BUSYBOX, "busybox (apt-get install busybox-static)"),
                       (shutil.which("cpio"), "cpio (apt-get install cpio)")):
         if not path:
             return "missing " + why
-    for path in (OVMF_CODE, OVMF_VARS):
-        if not os.path.exists(path):
-            return f"missing {path} (apt-get install ovmf)"
     for name in ("vmlinuz", "efivarfs.ko"):
         if not os.path.exists(os.path.join(KERNEL_DIR, name)):
             return f"missing {KERNEL_DIR}/{name} (run tests/firmware/fetch-kernel)"
@@ -192,63 +188,21 @@ class Boot:
 
 def boot(folder, initrd, phase):
     console = os.path.join(folder, f"console-{phase}.log")
-    qmp_path = os.path.join(folder, "qmp.sock")
-    if os.path.exists(qmp_path):
-        os.remove(qmp_path)
-    command = [QEMU, "-machine", "q35", "-m", "512", "-smp", "1", "-display", "none", "-no-reboot", "-nic", "none",
-               "-drive", f"if=pflash,format=raw,unit=0,readonly=on,file={OVMF_CODE}",
-               "-drive", f"if=pflash,format=raw,unit=1,file={os.path.join(folder, 'vars.fd')}",
-               "-kernel", os.path.join(KERNEL_DIR, "vmlinuz"), "-initrd", initrd,
-               "-append", f"console=ttyS0 quiet loglevel=1 panic=-1 vtrphase={phase}",
-               "-serial", f"file:{console}", "-qmp", f"unix:{qmp_path},server=on,wait=off"]
-    started = time.monotonic()
-    qemu = subprocess.Popen(command, stdout=subprocess.DEVNULL, stderr=subprocess.PIPE)
-    reason = None
-    try:
-        monitor = None
-        for _ in range(200):
-            try:
-                monitor = socket.socket(socket.AF_UNIX)
-                monitor.connect(qmp_path)
-                break
-            except OSError:
-                monitor.close()
-                monitor = None
-                if qemu.poll() is not None:
-                    break
-                time.sleep(0.05)
-        if monitor is not None:
-            monitor.settimeout(BOOT_TIMEOUT)
-            stream = monitor.makefile("rwb")
-            stream.readline()  # greeting
-            stream.write(b'{"execute": "qmp_capabilities"}\n')
-            stream.flush()
-            try:
-                for line in stream:
-                    message = json.loads(line)
-                    if message.get("event") == "SHUTDOWN":
-                        reason = message["data"].get("reason")
-            except (socket.timeout, ConnectionError):
-                pass
-            monitor.close()
-        qemu.wait(timeout=30)
-    finally:
-        if qemu.poll() is None:
-            qemu.kill()
-            qemu.wait()
-    errors = qemu.stderr.read().decode(errors="replace")
-    qemu.stderr.close()
+    arguments = qemu_vm.firmware_arguments(os.path.join(folder, "vars.fd")) + [
+        "-m", "512", "-smp", "1",
+        "-kernel", os.path.join(KERNEL_DIR, "vmlinuz"), "-initrd", initrd,
+        "-append", f"console=ttyS0 quiet loglevel=1 panic=-1 vtrphase={phase}",
+        "-serial", f"file:{console}"]
+    run = qemu_vm.run(arguments, folder, BOOT_TIMEOUT)
     with open(console, errors="replace") as f:
         text = f.read().replace("\r", "")
-    if qemu.returncode != 0:
-        raise AssertionError(f"qemu exited {qemu.returncode}: {errors}\n{text}")
-    return Boot(text, reason, time.monotonic() - started)
+    return Boot(text, run.reason, run.seconds)
 
 
 class FirmwareVariablesTest(unittest.TestCase):
     def test_variables_survive_a_reboot_made_by_the_helper(self):
         with tempfile.TemporaryDirectory(prefix="vtr-vm.") as folder:
-            shutil.copy(OVMF_VARS, os.path.join(folder, "vars.fd"))
+            shutil.copy(qemu_vm.OVMF_VARS, os.path.join(folder, "vars.fd"))
             initrd = make_initramfs(folder)
 
             first = boot(folder, initrd, "first")
@@ -288,6 +242,6 @@ if __name__ == "__main__":
     why = missing_requirement()
     if why:
         print(f"SKIPPED: the firmware test cannot run here: {why}")
-        sys.exit(SKIP)
+        sys.exit(qemu_vm.SKIP)
     result = unittest.main(argv=sys.argv[:1], exit=False).result
     sys.exit(0 if result.wasSuccessful() else 1)
