@@ -45,10 +45,10 @@ mkdir -p /private/var/mobile/Media/DCIM && printf "a photo" > /private/var/mobil
 pid=$(main_pid)
 check "the helper runs (pid $pid)" [ "$pid" -gt 0 ]
 status=$(cat /proc/"$pid"/status)
-# The ten the unit names (0x168021f), as far as this container has them.
+# The twelve the unit names (0x9168021f), as far as this container has them.
 ours=$(awk '/^CapBnd:/ { print $2 }' /proc/1/status)
-want=$(printf '%016x' $((0x168021f & 0x$ours)))
-check "the helper's capability bounding set is the ten it needs ($want)" \
+want=$(printf '%016x' $((0x9168021f & 0x$ours)))
+check "the helper's capability bounding set is the twelve it needs ($want)" \
   grep -q "^CapBnd:[[:space:]]*$want$" <<<"$status"
 check "no new privileges" grep -q "^NoNewPrivs:[[:space:]]*1$" <<<"$status"
 check "a system-call filter" grep -q "^Seccomp:[[:space:]]*2$" <<<"$status"
