@@ -219,6 +219,12 @@ Status FinalLocation::putReadyInPlace() {
   if (exists(outgoing)) removeEntry(outgoing);
   struct stat incoming;
   if (!StatAt(parent_.get(), ready, &incoming)) return Error::FromErrno(AppendPathComponent(parentPath_, ready));
+  // Only a folder is put in place: the name lies in a client area, where a
+  // client may have had a link or a file made under it.
+  if (!S_ISDIR(incoming.st_mode)) {
+    removeEntry(ready);
+    return Error(ENOTDIR, AppendPathComponent(parentPath_, ready) + " is not a folder");
+  }
   const bool replacing = exists(name_);
   if (!replacing) {
     if (Status s = RenameWithin(parent_.get(), ready, parent_.get(), name_, path_); !s.ok()) return s;

@@ -192,5 +192,28 @@ TEST_F(DurabilityTest, AManifestKilledMidScanLeavesNothingAndTheOldManifestWhole
   EXPECT_EQ(sandbox_.terminate(), 0);
 }
 
+TEST_F(DurabilityTest, OnlyAFolderIsEverPutInPlaceOfTheFinalLocation) {
+  // A client may have the helper link its own link or file under the name
+  // of ready content: the next start must not put it in place.
+  MakeTree(backup, "old", 1, 2);
+  const std::string oldText = TreeText(backup);
+  ASSERT_EQ(::symlink("/private/var/root", sandbox_.host("/private/var/mobile/l").c_str()), 0);
+  WriteFile(sandbox_.host("/private/var/mobile/f"), "client file");
+  for (const char* planted : {"/private/var/mobile/l", "/private/var/mobile/f"}) {
+    SCOPED_TRACE(planted);
+    ASSERT_TRUE(sandbox_.start()) << sandbox_.log();
+    EXPECT_EQ(Answer(sandbox_, "createHardLink:",
+                     XpcObject::Dictionary({{"FilePath", XpcObject::String(planted)},
+                                            {"StagingPath", XpcObject::String("/private/var/.backup.ready")}})),
+              true);
+    EXPECT_EQ(sandbox_.terminate(), 0);
+    ASSERT_TRUE(sandbox_.start()) << sandbox_.log();
+    EXPECT_EQ(sandbox_.terminate(), 0);
+    EXPECT_TRUE(S_ISDIR(Lstat(backup).st_mode)) << sandbox_.log();
+    EXPECT_EQ(TreeText(backup), oldText);
+    EXPECT_FALSE(Exists(var + "/.backup.ready"));
+  }
+}
+
 }  // namespace
 }  // namespace vtr::testing
