@@ -126,7 +126,7 @@ Status FinalLocation::receive(int stagingParent, const std::string& stagingName,
   const std::string readyPath = AppendPathComponent(parentPath_, ready);
   Status renamed = RenameWithin(stagingParent, stagingName, parent_.get(), ready, stagingPath);
   if (!renamed.ok() && renamed.error().code() == EXDEV) {
-    return copyAcross(stagingParent, stagingName, stagingPath);
+    return copyAcross(stagingParent, stagingName, staged, stagingPath);
   }
   if (!renamed.ok()) return renamed;
   // The staging folder is the client's: what it held when it was moved must
@@ -148,7 +148,8 @@ Status FinalLocation::receive(int stagingParent, const std::string& stagingName,
   return Status::Ok();
 }
 
-Status FinalLocation::copyAcross(int stagingParent, const std::string& stagingName, const std::string& stagingPath) {
+Status FinalLocation::copyAcross(int stagingParent, const std::string& stagingName, const struct stat& staged,
+                                 const std::string& stagingPath) {
   const std::string incoming = entry(".incoming-") + RandomHex();
   const std::string incomingPath = AppendPathComponent(parentPath_, incoming);
   Status copied = CopyItemAt(stagingParent, stagingName, parent_.get(), incoming, stagingPath, incomingPath);
@@ -172,7 +173,7 @@ Status FinalLocation::copyAcross(int stagingParent, const std::string& stagingNa
   Status made = ::syncfs(parent_.get()) == 0 ? Status::Ok() : Status(Error::FromErrno("syncfs " + incomingPath));
   if (made.ok()) made = RenameWithin(parent_.get(), incoming, parent_.get(), ready, incomingPath);
   if (made.ok()) made = SyncDirectory(parent_.get(), parentPath_);
-  if (made.ok()) made = moveSourceAside(stagingParent, stagingName, stagingPath);
+  if (made.ok()) made = moveSourceAside(stagingParent, stagingName, staged, stagingPath);
   if (!made.ok()) {
     removeEntry(incoming);
     removeEntry(ready);
@@ -180,7 +181,7 @@ Status FinalLocation::copyAcross(int stagingParent, const std::string& stagingNa
   return made;
 }
 
-Status FinalLocation::moveSourceAside(int stagingParent, const std::string& stagingName,
+Status FinalLocation::moveSourceAside(int stagingParent, const std::string& stagingName, const struct stat& staged,
                                       const std::string& stagingPath) {
   const std::string aside = AsideName(stagingName);
   const std::string asidePath = AppendPathComponent(SplitLastComponent(stagingPath).parent, aside);
@@ -190,8 +191,21 @@ Status FinalLocation::moveSourceAside(int stagingParent, const std::string& stag
   // A folder of that name left by an earlier move is a leftover of the same kind.
   (void)RemoveItemAt(stagingParent, aside, asidePath);
   Status moved = RenameWithin(stagingParent, stagingName, stagingParent, aside, stagingPath);
+  if (!moved.ok()) {
+    (void)::unlinkat(parent_.get(), (entry(".source")).c_str(), 0);
+    return moved;
+  }
+  // The name is the client's: only the directory checked (and copied) is
+  // set aside to be removed; anything swapped in for it goes back.
+  struct stat st;
+  if (!StatAt(stagingParent, aside, &st) || st.st_dev != staged.st_dev || st.st_ino != staged.st_ino) {
+    moved = Error(EAGAIN, stagingPath + " changed while it was moved");
+  }
   if (moved.ok()) moved = SyncDirectory(stagingParent, stagingPath);
-  if (!moved.ok()) (void)::unlinkat(parent_.get(), (entry(".source")).c_str(), 0);
+  if (!moved.ok()) {
+    (void)RenameWithin(stagingParent, aside, stagingParent, stagingName, asidePath);
+    (void)::unlinkat(parent_.get(), (entry(".source")).c_str(), 0);
+  }
   return moved;
 }
 

@@ -82,9 +82,13 @@ class FinalLocation {
   // the record.
   void removeMovedSource();
   // Makes the copy of stagingName across file systems, as receive() says.
-  Status copyAcross(int stagingParent, const std::string& stagingName, const std::string& stagingPath);
-  // Renames the copied staging folder aside, after recording where.
-  Status moveSourceAside(int stagingParent, const std::string& stagingName, const std::string& stagingPath);
+  Status copyAcross(int stagingParent, const std::string& stagingName, const struct stat& staged,
+                    const std::string& stagingPath);
+  // Renames the copied staging folder aside, after recording where; put
+  // back when what was renamed is not the directory staged, or the rename
+  // cannot be synced.
+  Status moveSourceAside(int stagingParent, const std::string& stagingName, const struct stat& staged,
+                         const std::string& stagingPath);
 
   UniqueFd parent_;
   std::string path_;

@@ -55,11 +55,11 @@ std::string TreeText(const std::string& root) {
   return text;
 }
 
-// Kills pid as soon as an entry whose name begins with prefix is created,
-// renamed into or removed from one of folders; false when none was before
-// limit.
-bool KillWhenSeen(pid_t pid, const std::vector<std::string>& folders, const std::string& prefix,
-                  std::chrono::milliseconds limit, const std::function<void()>& start) {
+// Does act as soon as an entry whose name begins with prefix is created,
+// renamed into or removed from one of folders, answering what it answers;
+// false when none was before limit.
+bool ActWhenSeen(const std::vector<std::string>& folders, const std::string& prefix, std::chrono::milliseconds limit,
+                 const std::function<void()>& start, const std::function<bool()>& act) {
   UniqueFd watch(::inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
   for (const std::string& f : folders) ::inotify_add_watch(watch.get(), f.c_str(), IN_CREATE | IN_MOVED_TO | IN_DELETE);
   start();
@@ -69,7 +69,7 @@ bool KillWhenSeen(pid_t pid, const std::vector<std::string>& folders, const std:
     const ssize_t n = ::poll(&ready, 1, 10) > 0 ? ::read(watch.get(), buffer, sizeof buffer) : 0;
     for (ssize_t at = 0; at < n;) {
       const auto* event = reinterpret_cast<const struct inotify_event*>(buffer + at);
-      if (event->len > 0 && std::string(event->name).rfind(prefix, 0) == 0) return ::kill(pid, SIGKILL) == 0;
+      if (event->len > 0 && std::string(event->name).rfind(prefix, 0) == 0) return act();
       at += static_cast<ssize_t>(sizeof(struct inotify_event) + event->len);
     }
   }
@@ -108,8 +108,10 @@ TEST_F(DurabilityTest, AMoveAcrossFileSystemsKilledAnywhereEndsWithTheOldOrTheWh
     const std::string oldText = TreeText(backup), newText = TreeText(staging);
     ASSERT_TRUE(sandbox_.start()) << sandbox_.log();
     std::thread client;
-    const bool killed = KillWhenSeen(sandbox_.pid(), {var, stageFs, staging + "/d0"}, seen ? seen : "", seen ? 20s : 0s,
-                                     [&] { client = std::thread([&] { Answer(sandbox_, "moveStagingToFinal:", stagingPath, 60s); }); });
+    const bool killed = ActWhenSeen(
+        {var, stageFs, staging + "/d0"}, seen ? seen : "", seen ? 20s : 0s,
+        [&] { client = std::thread([&] { Answer(sandbox_, "moveStagingToFinal:", stagingPath, 60s); }); },
+        [&] { return ::kill(sandbox_.pid(), SIGKILL) == 0; });
     client.join();
     EXPECT_EQ(killed, seen != nullptr) << "the helper finished before it was seen at work";
     EXPECT_EQ(killed ? sandbox_.waitForExit(5s) : sandbox_.terminate(), killed ? -1 : 0);
@@ -213,6 +215,28 @@ TEST_F(DurabilityTest, OnlyAFolderIsEverPutInPlaceOfTheFinalLocation) {
     EXPECT_EQ(TreeText(backup), oldText);
     EXPECT_FALSE(Exists(var + "/.backup.ready"));
   }
+}
+
+TEST_F(DurabilityTest, AFolderSwappedInForTheStagingFolderDuringTheCopyIsNeitherMovedNorRemoved) {
+  ASSERT_NO_FATAL_FAILURE(mountStagingFileSystem());
+  MakeTree(staging, "new", 20, 40);
+  ASSERT_TRUE(sandbox_.start()) << sandbox_.log();
+  std::thread client;
+  std::optional<bool> answer;
+  // Once the copy has begun, the client puts another folder in its place.
+  EXPECT_TRUE(ActWhenSeen(
+      {var}, ".backup.incoming-", 20s,
+      [&] { client = std::thread([&] { answer = Answer(sandbox_, "moveStagingToFinal:", stagingPath, 60s); }); },
+      [&] {
+        const bool swapped = ::rename(staging.c_str(), (stageFs + "/checked").c_str()) == 0 && MakeDirectories(staging).ok();
+        WriteFile(staging + "/swapped", "in");
+        return swapped;
+      }));
+  client.join();
+  EXPECT_EQ(answer, false);
+  EXPECT_EQ(ReadFile(staging + "/swapped"), "in");
+  EXPECT_EQ(Names(stageFs), (std::vector<std::string>{"VTR_staging", "checked"}));
+  EXPECT_EQ(sandbox_.terminate(), 0);
 }
 
 }  // namespace
