@@ -3,6 +3,8 @@
 #include <fcntl.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <iterator>
 #include <optional>
 #include <random>
 
@@ -17,6 +19,9 @@
 
 namespace vtr {
 namespace {
+
+// The helper's records beside the final location (entry suffixes).
+constexpr const char* kRecordSuffixes[] = {".placing", ".source"};
 
 // The longest staging path .NAME.source may hold.
 constexpr size_t kMaxRecordBytes = 4096;
@@ -85,10 +90,23 @@ std::optional<std::string> FinalLocation::readRecord(const std::string& name) co
 
 void FinalLocation::finishInterruptedMove() {
   const std::string incoming = entry(".incoming-");
+  // A record killed between its naming and its rename bears its temporary
+  // name (see AtomicFile): ".", the record's name, "." and six characters.
+  const auto isUnfinishedRecord = [this](const std::string& name) {
+    return std::any_of(std::begin(kRecordSuffixes), std::end(kRecordSuffixes), [&](const char* suffix) {
+      const std::string prefix = "." + entry(suffix) + ".";
+      return HasPrefix(name, prefix) && name.size() == prefix.size() + 6;
+    });
+  };
   if (Result<std::vector<std::string>> names = DirectoryEntryNames(parent_.get(), parentPath_); names.ok()) {
     for (const std::string& name : *names) {
-      if (!HasPrefix(name, incoming)) continue;
-      VTRLog("Removing %@, the partial copy of an interrupted move", AppendPathComponent(parentPath_, name));
+      if (HasPrefix(name, incoming)) {
+        VTRLog("Removing %@, the partial copy of an interrupted move", AppendPathComponent(parentPath_, name));
+      } else if (isUnfinishedRecord(name)) {
+        VTRLog("Removing %@, a record an interrupted move had not finished", AppendPathComponent(parentPath_, name));
+      } else {
+        continue;
+      }
       removeEntry(name);
     }
   }

@@ -201,6 +201,9 @@ TEST_F(DurabilityTest, OnlyAFolderIsEverPutInPlaceOfTheFinalLocation) {
   const std::string oldText = TreeText(backup);
   ASSERT_EQ(::symlink("/private/var/root", sandbox_.host("/private/var/mobile/l").c_str()), 0);
   WriteFile(sandbox_.host("/private/var/mobile/f"), "client file");
+  // Records killed between their naming and their rename go too.
+  WriteFile(var + "/..backup.placing.Ab12Cd", "1");
+  WriteFile(var + "/..backup.source.Ab12Cd", "/private/var/mobile/.VTR_staging.moving");
   for (const char* planted : {"/private/var/mobile/l", "/private/var/mobile/f"}) {
     SCOPED_TRACE(planted);
     ASSERT_TRUE(sandbox_.start()) << sandbox_.log();
@@ -213,7 +216,7 @@ TEST_F(DurabilityTest, OnlyAFolderIsEverPutInPlaceOfTheFinalLocation) {
     EXPECT_EQ(sandbox_.terminate(), 0);
     EXPECT_TRUE(S_ISDIR(Lstat(backup).st_mode)) << sandbox_.log();
     EXPECT_EQ(TreeText(backup), oldText);
-    EXPECT_FALSE(Exists(var + "/.backup.ready"));
+    for (const std::string& name : Names(var)) EXPECT_EQ(name.find("backup."), std::string::npos) << name;
   }
 }
 
