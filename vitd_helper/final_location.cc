@@ -80,8 +80,13 @@ Status FinalLocation::writeRecord(const std::string& name, const std::string& te
 }
 
 std::optional<std::string> FinalLocation::readRecord(const std::string& name) const {
-  UniqueFd fd = OpenAt(parent_.get(), name, O_RDONLY | O_NOFOLLOW | O_CLOEXEC);
-  if (!fd) return std::nullopt;
+  // Only a file the helper wrote counts, and nothing else is waited on: a
+  // client may have had its own file or a fifo linked under the name.
+  UniqueFd fd = OpenAt(parent_.get(), name, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC);
+  struct stat st;
+  if (!fd || ::fstat(fd.get(), &st) != 0 || !S_ISREG(st.st_mode) || st.st_uid != ::geteuid() || st.st_nlink != 1) {
+    return std::nullopt;
+  }
   std::string text(kMaxRecordBytes, '\0');
   const ssize_t n = ::read(fd.get(), text.data(), text.size());
   text.resize(n > 0 ? static_cast<size_t>(n) : 0);

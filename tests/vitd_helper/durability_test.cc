@@ -194,29 +194,35 @@ TEST_F(DurabilityTest, AManifestKilledMidScanLeavesNothingAndTheOldManifestWhole
   EXPECT_EQ(sandbox_.terminate(), 0);
 }
 
-TEST_F(DurabilityTest, OnlyAFolderIsEverPutInPlaceOfTheFinalLocation) {
-  // A client may have the helper link its own link or file under the name
-  // of ready content: the next start must not put it in place.
+TEST_F(DurabilityTest, WhatAClientHadLinkedUnderTheHelpersNamesIsNeitherPutInPlaceNorWaitedOn) {
+  // A client may have the helper link its own link, file or fifo under the
+  // name of ready content or of a record: the next start must not put it in
+  // place nor block on it.
   MakeTree(backup, "old", 1, 2);
   const std::string oldText = TreeText(backup);
   ASSERT_EQ(::symlink("/private/var/root", sandbox_.host("/private/var/mobile/l").c_str()), 0);
   WriteFile(sandbox_.host("/private/var/mobile/f"), "client file");
+  ASSERT_EQ(::mkfifo(sandbox_.host("/private/var/mobile/p").c_str(), 0644), 0);
   // Records killed between their naming and their rename go too.
   WriteFile(var + "/..backup.placing.Ab12Cd", "1");
   WriteFile(var + "/..backup.source.Ab12Cd", "/private/var/mobile/.VTR_staging.moving");
-  for (const char* planted : {"/private/var/mobile/l", "/private/var/mobile/f"}) {
-    SCOPED_TRACE(planted);
+  const std::pair<const char*, const char*> cases[] = {{"/private/var/mobile/l", "/private/var/.backup.ready"},
+                                                       {"/private/var/mobile/f", "/private/var/.backup.ready"},
+                                                       {"/private/var/mobile/p", "/private/var/.backup.placing"},
+                                                       {"/private/var/mobile/p", "/private/var/.backup.source"}};
+  for (const auto& [planted, name] : cases) {
+    SCOPED_TRACE(std::string(planted) + " as " + name);
     ASSERT_TRUE(sandbox_.start()) << sandbox_.log();
     EXPECT_EQ(Answer(sandbox_, "createHardLink:",
-                     XpcObject::Dictionary({{"FilePath", XpcObject::String(planted)},
-                                            {"StagingPath", XpcObject::String("/private/var/.backup.ready")}})),
+                     XpcObject::Dictionary(
+                         {{"FilePath", XpcObject::String(planted)}, {"StagingPath", XpcObject::String(name)}})),
               true);
     EXPECT_EQ(sandbox_.terminate(), 0);
     ASSERT_TRUE(sandbox_.start()) << sandbox_.log();
     EXPECT_EQ(sandbox_.terminate(), 0);
     EXPECT_TRUE(S_ISDIR(Lstat(backup).st_mode)) << sandbox_.log();
     EXPECT_EQ(TreeText(backup), oldText);
-    for (const std::string& name : Names(var)) EXPECT_EQ(name.find("backup."), std::string::npos) << name;
+    for (const std::string& left : Names(var)) EXPECT_EQ(left.find("backup."), std::string::npos) << left;
   }
 }
 
