@@ -248,5 +248,19 @@ TEST_F(DurabilityTest, AFolderSwappedInForTheStagingFolderDuringTheCopyIsNeither
   EXPECT_EQ(sandbox_.terminate(), 0);
 }
 
+TEST_F(DurabilityTest, ASecondHelperOnTheSameRootLeavesTheFirstOnesWorkAlone) {
+  ASSERT_TRUE(sandbox_.start()) << sandbox_.log();
+  // What the running helper has under way: a copy being made, a manifest's
+  // file between its naming and its rename.
+  MakeTree(var + "/.backup.incoming-abc123", "copy", 1, 1);
+  ASSERT_EQ(::mkdir((var + "/VTRWorkContainer").c_str(), 0755), 0);
+  WriteFile(var + "/VTRWorkContainer/.DeviceManifest.plist.Ab12Cd", "being renamed");
+  const HelperSandbox::RunResult second = sandbox_.run(HelperExecutable(), {"--root", sandbox_.root(), "--stderr"});
+  EXPECT_NE(second.status, 0);
+  EXPECT_TRUE(Exists(var + "/.backup.incoming-abc123/d0/f0")) << second.errors;
+  EXPECT_TRUE(Exists(var + "/VTRWorkContainer/.DeviceManifest.plist.Ab12Cd")) << second.errors;
+  EXPECT_EQ(sandbox_.terminate(), 0);
+}
+
 }  // namespace
 }  // namespace vtr::testing
