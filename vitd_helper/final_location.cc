@@ -132,7 +132,9 @@ void FinalLocation::finishInterruptedMove() {
       VTRLogError("Could not put %@ in place: %@", AppendPathComponent(parentPath_, ready), placed.error().description());
     }
   }
-  (void)::unlinkat(parent_.get(), (entry(".placing")).c_str(), 0);
+  // Whatever bears a record's name goes, a folder a client had made there
+  // too, or each later move would stumble on it.
+  if (exists(entry(".placing"))) removeEntry(entry(".placing"));
   if (exists(outgoing)) {
     VTRLog("Removing %@, the content an interrupted move replaced", AppendPathComponent(parentPath_, outgoing));
     removeEntry(outgoing);
@@ -245,7 +247,7 @@ void FinalLocation::removeMovedSource() {
     VTRLogError("Could not remove %@, a staging folder already moved to %@: %@", text, path_,
                 removed.error().description());
   }
-  (void)::unlinkat(parent_.get(), record.c_str(), 0);
+  removeEntry(record);
   (void)SyncDirectory(parent_.get(), recordPath);
 }
 

@@ -203,13 +203,16 @@ TEST_F(DurabilityTest, WhatAClientHadLinkedUnderTheHelpersNamesIsNeitherPutInPla
   ASSERT_EQ(::symlink("/private/var/root", sandbox_.host("/private/var/mobile/l").c_str()), 0);
   WriteFile(sandbox_.host("/private/var/mobile/f"), "client file");
   ASSERT_EQ(::mkfifo(sandbox_.host("/private/var/mobile/p").c_str(), 0644), 0);
+  ASSERT_TRUE(MakeDirectories(sandbox_.host("/private/var/mobile/d")).ok());
   // Records killed between their naming and their rename go too.
   WriteFile(var + "/..backup.placing.Ab12Cd", "1");
   WriteFile(var + "/..backup.source.Ab12Cd", "/private/var/mobile/.VTR_staging.moving");
   const std::pair<const char*, const char*> cases[] = {{"/private/var/mobile/l", "/private/var/.backup.ready"},
                                                        {"/private/var/mobile/f", "/private/var/.backup.ready"},
                                                        {"/private/var/mobile/p", "/private/var/.backup.placing"},
-                                                       {"/private/var/mobile/p", "/private/var/.backup.source"}};
+                                                       {"/private/var/mobile/p", "/private/var/.backup.source"},
+                                                       {"/private/var/mobile/d", "/private/var/.backup.source"},
+                                                       {"/private/var/mobile/d", "/private/var/.backup.placing"}};
   for (const auto& [planted, name] : cases) {
     SCOPED_TRACE(std::string(planted) + " as " + name);
     ASSERT_TRUE(sandbox_.start()) << sandbox_.log();
