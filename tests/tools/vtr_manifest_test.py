@@ -461,6 +461,8 @@ class SignedManifestTest(unittest.TestCase):
             ("not a property list", self.manifest + ".missing", None, 66, "No such file"),
             ("no anchors folder", signed, os.path.join(self.tmp, "absent"), 66,
              "trust anchors folder " + os.path.join(self.tmp, "absent") + ": No such file or directory"),
+            ("no folder above it", signed, os.path.join(self.tmp, "absent", "anchors"), 66,
+             os.path.join(self.tmp, "absent") + ": No such file or directory"),
         ]
         garbage = os.path.join(self.tmp, "garbage.plist")
         with open(garbage, "wb") as f:
