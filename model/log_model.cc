@@ -162,10 +162,15 @@ UniqueFd VTRLogModel::openLogFolder(const std::string& directory) {
 }
 
 bool VTRLogModel::openDayFile(int folder, const std::string& name, const std::string& path) {
-  UniqueFd fd = OpenAt(folder, name, O_WRONLY | O_APPEND | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC, 0644);
+  // Read too: the file's last byte says whether an earlier run left a
+  // fragment there.
+  UniqueFd fd = OpenAt(folder, name, O_RDWR | O_APPEND | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC, 0644);
   struct stat st;
   FILE* fp = nullptr;
+  bool endsInFragment = false;
   if (fd && StatOf(fd.get(), &st) && S_ISREG(st.st_mode) && st.st_uid == ThisUser() && st.st_nlink == 1) {
+    char last = '\n';
+    endsInFragment = st.st_size > 0 && ::pread(fd.get(), &last, 1, st.st_size - 1) == 1 && last != '\n';
     fp = ::fdopen(fd.get(), "a");
     if (fp != nullptr) fd.release();
   } else if (fd || errno == ELOOP) {
@@ -177,7 +182,7 @@ bool VTRLogModel::openDayFile(int folder, const std::string& name, const std::st
   }
   std::lock_guard<std::mutex> lock(mutex_);
   logFP_ = fp;
-  lineOpen_ = false;
+  lineOpen_ = endsInFragment;
   return fp != nullptr;
 }
 

@@ -3,6 +3,8 @@
 #include <fcntl.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <iterator>
 #include <optional>
 #include <random>
 
@@ -17,6 +19,9 @@
 
 namespace vtr {
 namespace {
+
+// The helper's records beside the final location (entry suffixes).
+constexpr const char* kRecordSuffixes[] = {".placing", ".source"};
 
 // The longest staging path .NAME.source may hold.
 constexpr size_t kMaxRecordBytes = 4096;
@@ -75,8 +80,13 @@ Status FinalLocation::writeRecord(const std::string& name, const std::string& te
 }
 
 std::optional<std::string> FinalLocation::readRecord(const std::string& name) const {
-  UniqueFd fd = OpenAt(parent_.get(), name, O_RDONLY | O_NOFOLLOW | O_CLOEXEC);
-  if (!fd) return std::nullopt;
+  // Only a file the helper wrote counts, and nothing else is waited on: a
+  // client may have had its own file or a fifo linked under the name.
+  UniqueFd fd = OpenAt(parent_.get(), name, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC);
+  struct stat st;
+  if (!fd || ::fstat(fd.get(), &st) != 0 || !S_ISREG(st.st_mode) || st.st_uid != ::geteuid() || st.st_nlink != 1) {
+    return std::nullopt;
+  }
   std::string text(kMaxRecordBytes, '\0');
   const ssize_t n = ::read(fd.get(), text.data(), text.size());
   text.resize(n > 0 ? static_cast<size_t>(n) : 0);
@@ -85,10 +95,23 @@ std::optional<std::string> FinalLocation::readRecord(const std::string& name) co
 
 void FinalLocation::finishInterruptedMove() {
   const std::string incoming = entry(".incoming-");
+  // A record killed between its naming and its rename bears its temporary
+  // name (see AtomicFile): ".", the record's name, "." and six characters.
+  const auto isUnfinishedRecord = [this](const std::string& name) {
+    return std::any_of(std::begin(kRecordSuffixes), std::end(kRecordSuffixes), [&](const char* suffix) {
+      const std::string prefix = "." + entry(suffix) + ".";
+      return HasPrefix(name, prefix) && name.size() == prefix.size() + 6;
+    });
+  };
   if (Result<std::vector<std::string>> names = DirectoryEntryNames(parent_.get(), parentPath_); names.ok()) {
     for (const std::string& name : *names) {
-      if (!HasPrefix(name, incoming)) continue;
-      VTRLog("Removing %@, the partial copy of an interrupted move", AppendPathComponent(parentPath_, name));
+      if (HasPrefix(name, incoming)) {
+        VTRLog("Removing %@, the partial copy of an interrupted move", AppendPathComponent(parentPath_, name));
+      } else if (isUnfinishedRecord(name)) {
+        VTRLog("Removing %@, a record an interrupted move had not finished", AppendPathComponent(parentPath_, name));
+      } else {
+        continue;
+      }
       removeEntry(name);
     }
   }
@@ -109,7 +132,9 @@ void FinalLocation::finishInterruptedMove() {
       VTRLogError("Could not put %@ in place: %@", AppendPathComponent(parentPath_, ready), placed.error().description());
     }
   }
-  (void)::unlinkat(parent_.get(), (entry(".placing")).c_str(), 0);
+  // Whatever bears a record's name goes, a folder a client had made there
+  // too, or each later move would stumble on it.
+  if (exists(entry(".placing"))) removeEntry(entry(".placing"));
   if (exists(outgoing)) {
     VTRLog("Removing %@, the content an interrupted move replaced", AppendPathComponent(parentPath_, outgoing));
     removeEntry(outgoing);
@@ -126,7 +151,7 @@ Status FinalLocation::receive(int stagingParent, const std::string& stagingName,
   const std::string readyPath = AppendPathComponent(parentPath_, ready);
   Status renamed = RenameWithin(stagingParent, stagingName, parent_.get(), ready, stagingPath);
   if (!renamed.ok() && renamed.error().code() == EXDEV) {
-    return copyAcross(stagingParent, stagingName, stagingPath);
+    return copyAcross(stagingParent, stagingName, staged, stagingPath);
   }
   if (!renamed.ok()) return renamed;
   // The staging folder is the client's: what it held when it was moved must
@@ -148,7 +173,8 @@ Status FinalLocation::receive(int stagingParent, const std::string& stagingName,
   return Status::Ok();
 }
 
-Status FinalLocation::copyAcross(int stagingParent, const std::string& stagingName, const std::string& stagingPath) {
+Status FinalLocation::copyAcross(int stagingParent, const std::string& stagingName, const struct stat& staged,
+                                 const std::string& stagingPath) {
   const std::string incoming = entry(".incoming-") + RandomHex();
   const std::string incomingPath = AppendPathComponent(parentPath_, incoming);
   Status copied = CopyItemAt(stagingParent, stagingName, parent_.get(), incoming, stagingPath, incomingPath);
@@ -172,7 +198,7 @@ Status FinalLocation::copyAcross(int stagingParent, const std::string& stagingNa
   Status made = ::syncfs(parent_.get()) == 0 ? Status::Ok() : Status(Error::FromErrno("syncfs " + incomingPath));
   if (made.ok()) made = RenameWithin(parent_.get(), incoming, parent_.get(), ready, incomingPath);
   if (made.ok()) made = SyncDirectory(parent_.get(), parentPath_);
-  if (made.ok()) made = moveSourceAside(stagingParent, stagingName, stagingPath);
+  if (made.ok()) made = moveSourceAside(stagingParent, stagingName, staged, stagingPath);
   if (!made.ok()) {
     removeEntry(incoming);
     removeEntry(ready);
@@ -180,7 +206,7 @@ Status FinalLocation::copyAcross(int stagingParent, const std::string& stagingNa
   return made;
 }
 
-Status FinalLocation::moveSourceAside(int stagingParent, const std::string& stagingName,
+Status FinalLocation::moveSourceAside(int stagingParent, const std::string& stagingName, const struct stat& staged,
                                       const std::string& stagingPath) {
   const std::string aside = AsideName(stagingName);
   const std::string asidePath = AppendPathComponent(SplitLastComponent(stagingPath).parent, aside);
@@ -190,8 +216,21 @@ Status FinalLocation::moveSourceAside(int stagingParent, const std::string& stag
   // A folder of that name left by an earlier move is a leftover of the same kind.
   (void)RemoveItemAt(stagingParent, aside, asidePath);
   Status moved = RenameWithin(stagingParent, stagingName, stagingParent, aside, stagingPath);
+  if (!moved.ok()) {
+    (void)::unlinkat(parent_.get(), (entry(".source")).c_str(), 0);
+    return moved;
+  }
+  // The name is the client's: only the directory checked (and copied) is
+  // set aside to be removed; anything swapped in for it goes back.
+  struct stat st;
+  if (!StatAt(stagingParent, aside, &st) || st.st_dev != staged.st_dev || st.st_ino != staged.st_ino) {
+    moved = Error(EAGAIN, stagingPath + " changed while it was moved");
+  }
   if (moved.ok()) moved = SyncDirectory(stagingParent, stagingPath);
-  if (!moved.ok()) (void)::unlinkat(parent_.get(), (entry(".source")).c_str(), 0);
+  if (!moved.ok()) {
+    (void)RenameWithin(stagingParent, aside, stagingParent, stagingName, asidePath);
+    (void)::unlinkat(parent_.get(), (entry(".source")).c_str(), 0);
+  }
   return moved;
 }
 
@@ -208,7 +247,7 @@ void FinalLocation::removeMovedSource() {
     VTRLogError("Could not remove %@, a staging folder already moved to %@: %@", text, path_,
                 removed.error().description());
   }
-  (void)::unlinkat(parent_.get(), record.c_str(), 0);
+  removeEntry(record);
   (void)SyncDirectory(parent_.get(), recordPath);
 }
 
@@ -219,6 +258,12 @@ Status FinalLocation::putReadyInPlace() {
   if (exists(outgoing)) removeEntry(outgoing);
   struct stat incoming;
   if (!StatAt(parent_.get(), ready, &incoming)) return Error::FromErrno(AppendPathComponent(parentPath_, ready));
+  // Only a folder is put in place: the name lies in a client area, where a
+  // client may have had a link or a file made under it.
+  if (!S_ISDIR(incoming.st_mode)) {
+    removeEntry(ready);
+    return Error(ENOTDIR, AppendPathComponent(parentPath_, ready) + " is not a folder");
+  }
   const bool replacing = exists(name_);
   if (!replacing) {
     if (Status s = RenameWithin(parent_.get(), ready, parent_.get(), name_, path_); !s.ok()) return s;

@@ -73,7 +73,8 @@ class FinalLocation {
   std::string entry(const char* suffix) const { return "." + name_ + suffix; }
   bool exists(const std::string& name) const;
   // A small file of the helper's beside the final location: written whole
-  // and synced, and read back (nullopt when there is none).
+  // and synced, and read back (nullopt when there is none, or what bears
+  // the name is not a regular file of the helper's with one link).
   Status writeRecord(const std::string& name, const std::string& text);
   std::optional<std::string> readRecord(const std::string& name) const;
   // Removes the helper's entry name (logging why when it cannot).
@@ -82,9 +83,13 @@ class FinalLocation {
   // the record.
   void removeMovedSource();
   // Makes the copy of stagingName across file systems, as receive() says.
-  Status copyAcross(int stagingParent, const std::string& stagingName, const std::string& stagingPath);
-  // Renames the copied staging folder aside, after recording where.
-  Status moveSourceAside(int stagingParent, const std::string& stagingName, const std::string& stagingPath);
+  Status copyAcross(int stagingParent, const std::string& stagingName, const struct stat& staged,
+                    const std::string& stagingPath);
+  // Renames the copied staging folder aside, after recording where; put
+  // back when what was renamed is not the directory staged, or the rename
+  // cannot be synced.
+  Status moveSourceAside(int stagingParent, const std::string& stagingName, const struct stat& staged,
+                         const std::string& stagingPath);
 
   UniqueFd parent_;
   std::string path_;

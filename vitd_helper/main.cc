@@ -15,6 +15,7 @@
 #include "vitd_helper/partition_resize.h"
 #include "vitd_helper/sandbox.h"
 #include "vitd_helper/service.h"
+#include "xpc/listener.h"
 #include "xpc/peer_identity.h"
 
 namespace {
@@ -120,7 +121,10 @@ int main(int argc, char** argv) {
 
   VTRLog("%s started", argv[0]);
   (void)logModel.enableLogToFilesUnder("/private/var/logs/vitd", "vitd_helper", 5);
-  VTRHOperations::sharedInstance().finishInterruptedWork();
+  // A helper already serving on this root may have work under way, which
+  // is not to be taken for interrupted work; this one then stops at its
+  // socket.
+  if (!Listener::AnotherServerListens(kServiceSocketPath)) VTRHOperations::sharedInstance().finishInterruptedWork();
 
   VTRProgressUpdater::sharedInstance().setSender(
       [](int64_t percent) { VTRHMessageResponder::sharedInstance().sendProgress(percent); });

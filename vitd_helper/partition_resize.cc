@@ -114,6 +114,14 @@ bool ReadGpt(GptRead* gpt) {
     JournalFailure("Cannot read the GPT of", path, image.error());
     return false;
   }
+  // The new table is made from the primary copy and written backup first:
+  // from a torn primary (a power cut during an earlier write) it would
+  // replace the one sound copy with what the tear left.
+  Result<GptValidity> copies = CheckGpt(fd, *blockSize, *blockCount);
+  if (!copies.ok() || !copies->primaryHeaderCrc || !copies->primaryTableCrc) {
+    VTRLogError("The primary GPT of %s does not match its CRCs; the sound backup copy is left as it is", path);
+    return false;
+  }
   gpt->image = *image;
   gpt->dataPosition = gpt->image.positionOf(kDataName);
   return true;

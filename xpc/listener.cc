@@ -81,6 +81,19 @@ Result<int> SocketOption(int fd, int option, const char* name) {
   return value;
 }
 
+// EADDRINUSE when a server takes connections at address, OK when no one
+// listens there (ECONNREFUSED), the error of the connection otherwise.
+Status ProbeServer(const struct sockaddr_un& address) {
+  UniqueFd probe(::socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0));
+  if (!probe) return Error::FromErrno("socket");
+  if (::connect(probe.get(), reinterpret_cast<const struct sockaddr*>(&address), sizeof address) == 0 ||
+      errno == EAGAIN) {
+    return Error(EADDRINUSE, "a server listens");
+  }
+  if (errno != ECONNREFUSED) return Error::FromErrno("connect");
+  return Status::Ok();
+}
+
 // Removes a socket left at path by an earlier run. A path that is not a
 // socket is left alone, and so is a socket that someone still listens on.
 Status RemoveStaleSocket(const std::string& path, const struct sockaddr_un& address) {
@@ -89,13 +102,10 @@ Status RemoveStaleSocket(const std::string& path, const struct sockaddr_un& addr
     return errno == ENOENT ? Status::Ok() : Status(Error::FromErrno("lstat " + path));
   }
   if (!S_ISSOCK(st.st_mode)) return Error(EEXIST, path + " exists and is not a socket");
-  UniqueFd probe(::socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0));
-  if (!probe) return Error::FromErrno("socket");
-  if (::connect(probe.get(), reinterpret_cast<const struct sockaddr*>(&address), sizeof address) == 0 ||
-      errno == EAGAIN) {
-    return Error(EADDRINUSE, "another server listens at " + path);
+  if (Status probed = ProbeServer(address); !probed) {
+    return probed.error().code() == EADDRINUSE ? Error(EADDRINUSE, "another server listens at " + path)
+                                               : Error(probed.error().code(), "connect " + path);
   }
-  if (errno != ECONNREFUSED) return Error::FromErrno("connect " + path);
   if (::unlink(path.c_str()) != 0 && errno != ENOENT) return Error::FromErrno("unlink " + path);
   return Status::Ok();
 }
@@ -156,6 +166,15 @@ Result<std::unique_ptr<Listener>> Listener::CreateFromSystemd(ListenerOptions op
   std::unique_ptr<Listener> listener(new Listener(UniqueFd(fd), std::move(options)));
   if (Status ready = listener->setUp(); !ready) return ready.error();
   return listener;
+}
+
+bool Listener::AnotherServerListens(const std::string& path) {
+  struct sockaddr_un address = {};
+  address.sun_family = AF_UNIX;
+  if (SystemdPassedSocket() || path.empty() || path.size() >= sizeof address.sun_path) return false;
+  std::memcpy(address.sun_path, path.data(), path.size());
+  Status probed = ProbeServer(address);
+  return !probed && probed.error().code() == EADDRINUSE;
 }
 
 Result<std::unique_ptr<Listener>> Listener::Create(const std::string& path, ListenerOptions options) {

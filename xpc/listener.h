@@ -105,6 +105,10 @@ class Listener {
   // systemd's socket when one was passed to this process, else at path.
   static Result<std::unique_ptr<Listener>> Create(const std::string& path, ListenerOptions options = {});
 
+  // Whether another server takes connections at path now, where Create
+  // would then fail: false when systemd passed this process its socket.
+  static bool AnotherServerListens(const std::string& path);
+
   // Closes every connection without events.
   ~Listener();
   Listener(const Listener&) = delete;

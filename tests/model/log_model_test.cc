@@ -92,10 +92,17 @@ TEST_F(LogModelTest, FileLinesCarryTheUtcDateAndKeepATrailingNewline) {
 
 TEST_F(LogModelTest, AnExistingFileIsAppendedToNeverTruncated) {
   clock_->set(Date::FromUnix(1795253400));
-  WriteFile(todaysFile(), "earlier run\n");
-  ASSERT_TRUE(model_.enableLogToFilesUnder(dir_.path(), "vitd_helper", 5));
-  model_.logMessage("restarted");
-  EXPECT_EQ(ReadFile(todaysFile()), "earlier run\n2026-11-21 09:30:00 +0000 restarted\n");
+  // A fragment an earlier run could not cut off (a kill, a power cut)
+  // ends before the first line of this one.
+  for (const std::string earlier : {"earlier run\n", "earlier run\nfragm"}) {
+    WriteFile(todaysFile(), earlier);
+    ASSERT_TRUE(model_.enableLogToFilesUnder(dir_.path(), "vitd_helper", 5));
+    model_.logMessage("restarted");
+    EXPECT_EQ(ReadFile(todaysFile()), earlier + (earlier.back() == '\n' ? "" : "\n") +
+                                          "2026-11-21 09:30:00 +0000 restarted\n");
+    std::fclose(model_.logFP());
+    model_.setLogFP(nullptr);
+  }
 }
 
 TEST_F(LogModelTest, AFullDiskCutsNoLineInTwo) {

@@ -28,8 +28,9 @@ TYPES = {
 }
 
 
-def run(*args, timeout=120, cwd=None):
-    return subprocess.run([os.path.join(BIN, "vtr-manifest"), *args], capture_output=True, timeout=timeout, cwd=cwd)
+def run(*args, timeout=120, cwd=None, **options):
+    return subprocess.run([os.path.join(BIN, "vtr-manifest"), *args], capture_output=True, timeout=timeout, cwd=cwd,
+                          **options)
 
 
 def make_tree(root):
@@ -177,6 +178,25 @@ class CreateTest(unittest.TestCase):
         result = run("create", self.root, "-o", "-", "--skip", b"dir/bad\xff name", cwd=self.tmp)
         self.assertEqual(set(plistlib.loads(result.stdout)), set(manifest))
         self.assertFalse(os.path.exists(os.path.join(self.tmp, "-")))
+
+    def test_a_file_that_cannot_be_read_fails_and_is_named(self):
+        tree = os.path.join(self.tmp, "closed-tree")
+        os.makedirs(tree)
+        with open(os.path.join(tree, "closed"), "w") as f:
+            f.write("content")
+        manifest = os.path.join(tree, "m.plist")
+        self.assertEqual(run("create", tree, "-o", manifest).returncode, 0)
+        os.chmod(os.path.join(tree, "closed"), 0)
+        # Root reads any file: the tool then runs as nobody, who may enter.
+        as_nobody = {"preexec_fn": lambda: os.setuid(65534)} if os.geteuid() == 0 else {}
+        for path in (self.tmp, tree):
+            os.chmod(path, 0o755)
+        for args in (["create", tree, "-o", "-"], ["compare", manifest, tree]):
+            with self.subTest(command=args[0]):
+                result = run(*args, env={**os.environ, "TMPDIR": "/tmp"}, **as_nobody)
+                self.assertEqual(result.returncode, 74, result.stderr)
+                self.assertIn(b"cannot read " + tree.encode() + b"/closed: its content cannot be read", result.stderr)
+                self.assertEqual(result.stdout, b"")
 
     def test_keys_relative_to_another_root_and_skips(self):
         manifest, _ = self.create("--relative-to", self.tmp, "--skip", "dir/sub", "--skip", os.path.join(self.root, "di"),
@@ -461,6 +481,8 @@ class SignedManifestTest(unittest.TestCase):
             ("not a property list", self.manifest + ".missing", None, 66, "No such file"),
             ("no anchors folder", signed, os.path.join(self.tmp, "absent"), 66,
              "trust anchors folder " + os.path.join(self.tmp, "absent") + ": No such file or directory"),
+            ("no folder above it", signed, os.path.join(self.tmp, "absent", "anchors"), 66,
+             os.path.join(self.tmp, "absent") + ": No such file or directory"),
         ]
         garbage = os.path.join(self.tmp, "garbage.plist")
         with open(garbage, "wb") as f:

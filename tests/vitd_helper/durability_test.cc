@@ -55,11 +55,11 @@ std::string TreeText(const std::string& root) {
   return text;
 }
 
-// Kills pid as soon as an entry whose name begins with prefix is created,
-// renamed into or removed from one of folders; false when none was before
-// limit.
-bool KillWhenSeen(pid_t pid, const std::vector<std::string>& folders, const std::string& prefix,
-                  std::chrono::milliseconds limit, const std::function<void()>& start) {
+// Does act as soon as an entry whose name begins with prefix is created,
+// renamed into or removed from one of folders, answering what it answers;
+// false when none was before limit.
+bool ActWhenSeen(const std::vector<std::string>& folders, const std::string& prefix, std::chrono::milliseconds limit,
+                 const std::function<void()>& start, const std::function<bool()>& act) {
   UniqueFd watch(::inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
   for (const std::string& f : folders) ::inotify_add_watch(watch.get(), f.c_str(), IN_CREATE | IN_MOVED_TO | IN_DELETE);
   start();
@@ -69,7 +69,7 @@ bool KillWhenSeen(pid_t pid, const std::vector<std::string>& folders, const std:
     const ssize_t n = ::poll(&ready, 1, 10) > 0 ? ::read(watch.get(), buffer, sizeof buffer) : 0;
     for (ssize_t at = 0; at < n;) {
       const auto* event = reinterpret_cast<const struct inotify_event*>(buffer + at);
-      if (event->len > 0 && std::string(event->name).rfind(prefix, 0) == 0) return ::kill(pid, SIGKILL) == 0;
+      if (event->len > 0 && std::string(event->name).rfind(prefix, 0) == 0) return act();
       at += static_cast<ssize_t>(sizeof(struct inotify_event) + event->len);
     }
   }
@@ -108,8 +108,10 @@ TEST_F(DurabilityTest, AMoveAcrossFileSystemsKilledAnywhereEndsWithTheOldOrTheWh
     const std::string oldText = TreeText(backup), newText = TreeText(staging);
     ASSERT_TRUE(sandbox_.start()) << sandbox_.log();
     std::thread client;
-    const bool killed = KillWhenSeen(sandbox_.pid(), {var, stageFs, staging + "/d0"}, seen ? seen : "", seen ? 20s : 0s,
-                                     [&] { client = std::thread([&] { Answer(sandbox_, "moveStagingToFinal:", stagingPath, 60s); }); });
+    const bool killed = ActWhenSeen(
+        {var, stageFs, staging + "/d0"}, seen ? seen : "", seen ? 20s : 0s,
+        [&] { client = std::thread([&] { Answer(sandbox_, "moveStagingToFinal:", stagingPath, 60s); }); },
+        [&] { return ::kill(sandbox_.pid(), SIGKILL) == 0; });
     client.join();
     EXPECT_EQ(killed, seen != nullptr) << "the helper finished before it was seen at work";
     EXPECT_EQ(killed ? sandbox_.waitForExit(5s) : sandbox_.terminate(), killed ? -1 : 0);
@@ -189,6 +191,77 @@ TEST_F(DurabilityTest, AManifestKilledMidScanLeavesNothingAndTheOldManifestWhole
                               "device manifest that was not finished"));
   EXPECT_EQ(Answer(sandbox_, "createDeviceManifest:", request, 60s), true);
   EXPECT_EQ(ReadFile(work + "/DeviceManifest.plist").rfind("bplist00", 0), 0u);
+  EXPECT_EQ(sandbox_.terminate(), 0);
+}
+
+TEST_F(DurabilityTest, WhatAClientHadLinkedUnderTheHelpersNamesIsNeitherPutInPlaceNorWaitedOn) {
+  // A client may have the helper link its own link, file or fifo under the
+  // name of ready content or of a record: the next start must not put it in
+  // place nor block on it.
+  MakeTree(backup, "old", 1, 2);
+  const std::string oldText = TreeText(backup);
+  ASSERT_EQ(::symlink("/private/var/root", sandbox_.host("/private/var/mobile/l").c_str()), 0);
+  WriteFile(sandbox_.host("/private/var/mobile/f"), "client file");
+  ASSERT_EQ(::mkfifo(sandbox_.host("/private/var/mobile/p").c_str(), 0644), 0);
+  ASSERT_TRUE(MakeDirectories(sandbox_.host("/private/var/mobile/d")).ok());
+  // Records killed between their naming and their rename go too.
+  WriteFile(var + "/..backup.placing.Ab12Cd", "1");
+  WriteFile(var + "/..backup.source.Ab12Cd", "/private/var/mobile/.VTR_staging.moving");
+  const std::pair<const char*, const char*> cases[] = {{"/private/var/mobile/l", "/private/var/.backup.ready"},
+                                                       {"/private/var/mobile/f", "/private/var/.backup.ready"},
+                                                       {"/private/var/mobile/p", "/private/var/.backup.placing"},
+                                                       {"/private/var/mobile/p", "/private/var/.backup.source"},
+                                                       {"/private/var/mobile/d", "/private/var/.backup.source"},
+                                                       {"/private/var/mobile/d", "/private/var/.backup.placing"}};
+  for (const auto& [planted, name] : cases) {
+    SCOPED_TRACE(std::string(planted) + " as " + name);
+    ASSERT_TRUE(sandbox_.start()) << sandbox_.log();
+    EXPECT_EQ(Answer(sandbox_, "createHardLink:",
+                     XpcObject::Dictionary(
+                         {{"FilePath", XpcObject::String(planted)}, {"StagingPath", XpcObject::String(name)}})),
+              true);
+    EXPECT_EQ(sandbox_.terminate(), 0);
+    ASSERT_TRUE(sandbox_.start()) << sandbox_.log();
+    EXPECT_EQ(sandbox_.terminate(), 0);
+    EXPECT_TRUE(S_ISDIR(Lstat(backup).st_mode)) << sandbox_.log();
+    EXPECT_EQ(TreeText(backup), oldText);
+    for (const std::string& left : Names(var)) EXPECT_EQ(left.find("backup."), std::string::npos) << left;
+  }
+}
+
+TEST_F(DurabilityTest, AFolderSwappedInForTheStagingFolderDuringTheCopyIsNeitherMovedNorRemoved) {
+  ASSERT_NO_FATAL_FAILURE(mountStagingFileSystem());
+  MakeTree(staging, "new", 20, 40);
+  ASSERT_TRUE(sandbox_.start()) << sandbox_.log();
+  std::thread client;
+  std::optional<bool> answer;
+  // Once the copy has begun, the client puts another folder in its place.
+  EXPECT_TRUE(ActWhenSeen(
+      {var}, ".backup.incoming-", 20s,
+      [&] { client = std::thread([&] { answer = Answer(sandbox_, "moveStagingToFinal:", stagingPath, 60s); }); },
+      [&] {
+        const bool swapped = ::rename(staging.c_str(), (stageFs + "/checked").c_str()) == 0 && MakeDirectories(staging).ok();
+        WriteFile(staging + "/swapped", "in");
+        return swapped;
+      }));
+  client.join();
+  EXPECT_EQ(answer, false);
+  EXPECT_EQ(ReadFile(staging + "/swapped"), "in");
+  EXPECT_EQ(Names(stageFs), (std::vector<std::string>{"VTR_staging", "checked"}));
+  EXPECT_EQ(sandbox_.terminate(), 0);
+}
+
+TEST_F(DurabilityTest, ASecondHelperOnTheSameRootLeavesTheFirstOnesWorkAlone) {
+  ASSERT_TRUE(sandbox_.start()) << sandbox_.log();
+  // What the running helper has under way: a copy being made, a manifest's
+  // file between its naming and its rename.
+  MakeTree(var + "/.backup.incoming-abc123", "copy", 1, 1);
+  ASSERT_EQ(::mkdir((var + "/VTRWorkContainer").c_str(), 0755), 0);
+  WriteFile(var + "/VTRWorkContainer/.DeviceManifest.plist.Ab12Cd", "being renamed");
+  const HelperSandbox::RunResult second = sandbox_.run(HelperExecutable(), {"--root", sandbox_.root(), "--stderr"});
+  EXPECT_NE(second.status, 0);
+  EXPECT_TRUE(Exists(var + "/.backup.incoming-abc123/d0/f0")) << second.errors;
+  EXPECT_TRUE(Exists(var + "/VTRWorkContainer/.DeviceManifest.plist.Ab12Cd")) << second.errors;
   EXPECT_EQ(sandbox_.terminate(), 0);
 }
 

@@ -423,6 +423,25 @@ TEST_F(DataPartitionTest, ALayoutThatWouldMoveAPartitionIsRefusedBeforeTheFileSy
   }
 }
 
+TEST_F(DataPartitionTest, ATornPrimaryTableIsNeverTheSourceOfANewOne) {
+  // A power cut while the primary table was written leaves it not matching
+  // its header's CRC, the backup whole: a resize from the torn copy would
+  // overwrite the one sound copy first.
+  MAKE_DISK_OR_SKIP(kDeviceLayout);
+  UniqueFd disk(::open(loop_->path().c_str(), O_WRONLY | O_CLOEXEC));
+  ASSERT_EQ(::pwrite(disk.get(), "X", 1, 2 * kSector + 56), 1);  // "System" becomes "Xystem"
+  ASSERT_EQ(::fsync(disk.get()), 0);
+  const uint64_t bytes = fileSystemBytes();
+  EXPECT_EQ(command("shrinkDataPartition:"), false);
+  EXPECT_TRUE(dayLogHas("The primary GPT of /dev/rdisk0s1 does not match its CRCs; the sound backup copy is left as "
+                        "it is"))
+      << sandbox_.log();
+  EXPECT_EQ(fileSystemBytes(), bytes);
+  const GptValidity after = validity();
+  EXPECT_FALSE(after.primaryTableCrc);
+  EXPECT_TRUE(after.backupHeaderCrc && after.backupTableCrc);
+}
+
 TEST_F(DataPartitionTest, WithoutADataEntryANewPartitionIsMadeAfterTheOthers) {
   MAKE_DISK_OR_SKIP({{"System", 256, 16384}});
   ASSERT_EQ(command("expandDataPartition:"), true) << sandbox_.log();

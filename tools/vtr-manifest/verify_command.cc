@@ -2,7 +2,7 @@
 #include <nlohmann/json.hpp>
 
 #include <cstring>
-#include <string_view>
+#include <string>
 
 #include "platform/device_properties.h"
 #include "platform/trust_policy.h"
@@ -24,12 +24,18 @@ bool AnchorsUsable(const SigningAnchors& anchors, Console& console) {
   for (const std::string& folder : folders) {
     Result<TrustPolicy> policy = TrustPolicy::Create(folder, anchors.rootFd);
     if (policy.ok()) return true;
-    // The error names the folder itself; the reason is what is left.
+    // An error that names the folder itself says the rest; one that names
+    // a folder above it (missing, a link) says which, with the reason.
     const Error& error = policy.error();
-    std::string_view why = error.message();
-    if (why == folder) why = std::strerror(error.code());
-    if (why.starts_with(folder + " ")) why.remove_prefix(folder.size() + 1);
-    problems.push_back("vtr-manifest: trust anchors folder " + EscapedText(folder) + ": " + std::string(why));
+    std::string why = error.message();
+    if (why == folder) {
+      why = std::strerror(error.code());
+    } else if (why.starts_with(folder + " ")) {
+      why.erase(0, folder.size() + 1);
+    } else {
+      why = error.description();
+    }
+    problems.push_back("vtr-manifest: trust anchors folder " + EscapedText(folder) + ": " + why);
   }
   for (const std::string& problem : problems) console.print(problem);
   return false;

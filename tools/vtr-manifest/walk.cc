@@ -11,6 +11,7 @@
 #include <string_view>
 
 #include "model/progress_updater.h"
+#include "platform/file_manager.h"
 #include "tools/vtr-manifest/manifest_render.h"
 
 namespace vtr::manifest_tool {
@@ -118,8 +119,21 @@ WalkOutcome RunWalk(const WalkOptions& options, const VTRManifest::Handler& hand
     updater.setSender([&console](int64_t percent) { console.showProgress(percent); });
     manifest.setProgressUpdater(&updater);
   }
-  outcome.filled = manifest.enumerateAndCollectMetaData(options.tree, options.relativeTo.value_or(options.tree),
-                                                        options.skip, options.inclusive, handler);
+  // The builder records a regular file whose content it cannot read with an
+  // empty digest (the helper's rule, for files without local content): a
+  // tool names it instead of writing a record that no reading matches.
+  const std::string base = options.relativeTo.value_or(options.tree);
+  const VTRManifest::Handler described = [&](const VTRFileMetadata& record, const std::string& key) {
+    const std::string* type = record.getFileType();
+    const Bytes* digest = record.getHash();
+    if (type != nullptr && *type == kNSFileTypeRegular && digest != nullptr && digest->empty()) {
+      outcome.omitted.emplace_back(base == "/" ? key : base + key, Error(0, "its content cannot be read"));
+      return true;
+    }
+    return handler(record, key);
+  };
+  outcome.filled =
+      manifest.enumerateAndCollectMetaData(options.tree, base, options.skip, options.inclusive, described);
   console.finish();
   return outcome;
 }

@@ -41,7 +41,8 @@ struct WalkOutcome {
 };
 
 // Fills a new manifest from options (prepared), handing each record to
-// handler. When console draws progress, the builder's progress goes to its
+// handler, but for a regular file whose content cannot be read, which is
+// counted as omitted. When console draws progress, the builder's progress goes to its
 // bar.
 WalkOutcome RunWalk(const WalkOptions& options, const VTRManifest::Handler& handler, Console& console);
 
