@@ -6,6 +6,8 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <cerrno>
+
 #include "model/file_hash.h"
 #include "model/log.h"
 #include "model/restore_steps.h"
@@ -41,6 +43,25 @@ const char* ContentRefusal(const VTRFileMetadata& record, const struct stat& st)
   return nullptr;
 }
 
+// Drops the access list of the item open as fd: mobile's own on its staged
+// file, or one a copy inherited from the default list of mobile's folder. A
+// named entry in it outlives any change of owner or mode and, under a
+// record whose group may write, would let mobile write the granted file. A
+// list the record holds is laid on again with its extended attributes.
+bool DropAccessList(int fd) {
+  return RemoveExtendedAttributeOf(fd, "system.posix_acl_access") == 0 || errno == ENODATA || errno == EOPNOTSUPP;
+}
+
+// Closes the staged file open as fd to everyone but the helper before its
+// content is judged: owner and group the helper's, mode 0600, no access
+// list. An open for writing that passed its permission check while the file
+// was still mobile's and has not yet taken its write access (which a lease
+// cannot see) must be caught by the lease while the content is hashed, not
+// after the grant.
+bool CloseToOthers(int fd) {
+  return ::fchown(fd, ThisUser(), ::getegid()) == 0 && ::fchmod(fd, 0600) == 0 && DropAccessList(fd);
+}
+
 void LogRefusal(const std::string& path, const char* why) {
   VTRLogError("Not granting privilege to %@: %@", path, std::string(why));
 }
@@ -69,10 +90,14 @@ std::optional<bool> RestoreInPlace(const VTRFileMetadata& record, const Dictiona
   if (st.st_nlink != 1) return std::nullopt;
   WriterLease lease(item);
   if (!lease.held()) return std::nullopt;
+  if (!CloseToOthers(item) || !lease.stillAlone()) {
+    TakeBack(record, item, st);
+    return std::nullopt;
+  }
   const std::optional<Bytes> digest = fileHashOfDescriptor(item, path, PageCache::kKeep);
-  if (!digest) return false;
-  if (*digest != *record.getHash()) {
-    LogRefusal(path, "its content does not hash to the record's");
+  if (!digest || *digest != *record.getHash()) {
+    TakeBack(record, item, st);
+    if (digest) LogRefusal(path, "its content does not hash to the record's");
     return false;
   }
   // Asked before the grant as well as after: a writer that was let in when
@@ -126,8 +151,8 @@ bool RestoreOntoVerifiedCopy(const VTRFileMetadata& record, int dirFd, const std
   if (std::optional<bool> inPlace = RestoreInPlace(record, all, item, st, path)) return *inPlace;
   Result<ItemOwnership> ownership = OwnershipAfter(all, st, path, AttributesAllowedToSet());
   Result<FreshFile> copy = ownership.ok() ? FreshFile::MakeIn(dirFd, path) : Result<FreshFile>(ownership.error());
-  if (!copy.ok()) {
-    LogAttributesNotSet(path, copy.error(), all);
+  if (!copy.ok() || !DropAccessList(copy->fd())) {
+    LogAttributesNotSet(path, copy.ok() ? Error::FromErrno(path) : copy.error(), all);
     return false;
   }
   const std::optional<Bytes> digest = copyHashing(item, static_cast<uint64_t>(st.st_size), copy->fd());

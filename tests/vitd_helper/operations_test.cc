@@ -450,6 +450,12 @@ TEST_F(RestoreTest, PrivilegeGoesOnlyToTheSignedContentOnAnInodeNobodyElseHolds)
   // The signed bytes, with a writable descriptor, a shared writable mapping
   // and a second link that mobile keeps: none reaches the restored file.
   LayDown();
+  // Mobile's access lists too: one on a file granted in place, a default
+  // one on the folder a copy is made in.
+  const std::string acl = {2, 0, 0, 0, 1, 0, 6, 0, -1, -1, -1, -1, 2, 0, 6, 0, -11, 1, 0, 0,
+                           4, 0, 4, 0, -1, -1, -1, -1, 16, 0, 6, 0, -1, -1, -1, -1, 32, 0, 4, 0, -1, -1, -1, -1};
+  ASSERT_EQ(::setxattr((staging + "/d/f").c_str(), "system.posix_acl_access", acl.data(), acl.size(), 0), 0);
+  ASSERT_EQ(::setxattr((staging + "/d").c_str(), "system.posix_acl_default", acl.data(), acl.size(), 0), 0);
   const std::string g = staging + "/d/g";
   const std::string kept = host("/private/var/mobile/kept");
   ASSERT_EQ(::link(g.c_str(), kept.c_str()), 0);
@@ -464,6 +470,7 @@ TEST_F(RestoreTest, PrivilegeGoesOnlyToTheSignedContentOnAnInodeNobodyElseHolds)
   const struct stat restored = Lstat(g);
   EXPECT_EQ(restored.st_mode & 07777, 04755u);
   EXPECT_EQ(restored.st_nlink, 1u);
+  for (const char* file : {"f", "g"}) EXPECT_EQ(Xattr(staging + "/d/" + file, "system.posix_acl_access"), "<none>") << file;
   EXPECT_EQ(Lstat(staging + "/d").st_mtim.tv_sec, 1000000000) << "once the copy beneath it is in place";
   EXPECT_EQ(Lstat(kept).st_uid, kMobile);
   EXPECT_EQ(Lstat(kept).st_mode & 06000, 0u);
