@@ -43,15 +43,6 @@ const char* ContentRefusal(const VTRFileMetadata& record, const struct stat& st)
   return nullptr;
 }
 
-// Drops the access list of the item open as fd: mobile's own on its staged
-// file, or one a copy inherited from the default list of mobile's folder. A
-// named entry in it outlives any change of owner or mode and, under a
-// record whose group may write, would let mobile write the granted file. A
-// list the record holds is laid on again with its extended attributes.
-bool DropAccessList(int fd) {
-  return RemoveExtendedAttributeOf(fd, "system.posix_acl_access") == 0 || errno == ENODATA || errno == EOPNOTSUPP;
-}
-
 // Closes the staged file open as fd to everyone but the helper before its
 // content is judged: owner and group the helper's, mode 0600, no access
 // list. An open for writing that passed its permission check while the file
@@ -59,7 +50,7 @@ bool DropAccessList(int fd) {
 // cannot see) must be caught by the lease while the content is hashed, not
 // after the grant.
 bool CloseToOthers(int fd) {
-  return ::fchown(fd, ThisUser(), ::getegid()) == 0 && ::fchmod(fd, 0600) == 0 && DropAccessList(fd);
+  return ::fchown(fd, ThisUser(), ::getegid()) == 0 && ::fchmod(fd, 0600) == 0 && DropAccessLists(fd);
 }
 
 void LogRefusal(const std::string& path, const char* why) {
@@ -130,6 +121,15 @@ std::optional<bool> RestoreInPlace(const VTRFileMetadata& record, const Dictiona
 
 }  // namespace
 
+bool DropAccessLists(int fd) {
+  auto drop = [fd](const char* name) {
+    return RemoveExtendedAttributeOf(fd, name) == 0 || errno == ENODATA || errno == EOPNOTSUPP;
+  };
+  struct stat st;
+  return ::fstat(fd, &st) == 0 && drop("system.posix_acl_access") &&
+         (!S_ISDIR(st.st_mode) || drop("system.posix_acl_default"));
+}
+
 bool GrantsPrivilege(const VTRFileMetadata& record, const struct stat& st, const ClientAccount& client) {
   static const Dictionary kNone;
   const Dictionary* attributes = record.getFileAttributes();
@@ -151,7 +151,7 @@ bool RestoreOntoVerifiedCopy(const VTRFileMetadata& record, int dirFd, const std
   if (std::optional<bool> inPlace = RestoreInPlace(record, all, item, st, path)) return *inPlace;
   Result<ItemOwnership> ownership = OwnershipAfter(all, st, path, AttributesAllowedToSet());
   Result<FreshFile> copy = ownership.ok() ? FreshFile::MakeIn(dirFd, path) : Result<FreshFile>(ownership.error());
-  if (!copy.ok() || !DropAccessList(copy->fd())) {
+  if (!copy.ok() || !DropAccessLists(copy->fd())) {
     LogAttributesNotSet(path, copy.ok() ? Error::FromErrno(path) : copy.error(), all);
     return false;
   }

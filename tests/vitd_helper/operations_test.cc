@@ -471,6 +471,7 @@ TEST_F(RestoreTest, PrivilegeGoesOnlyToTheSignedContentOnAnInodeNobodyElseHolds)
   EXPECT_EQ(restored.st_mode & 07777, 04755u);
   EXPECT_EQ(restored.st_nlink, 1u);
   for (const char* file : {"f", "g"}) EXPECT_EQ(Xattr(staging + "/d/" + file, "system.posix_acl_access"), "<none>") << file;
+  EXPECT_EQ(Xattr(staging + "/d", "system.posix_acl_default"), "<none>") << "root's folder";
   EXPECT_EQ(Lstat(staging + "/d").st_mtim.tv_sec, 1000000000) << "once the copy beneath it is in place";
   EXPECT_EQ(Lstat(kept).st_uid, kMobile);
   EXPECT_EQ(Lstat(kept).st_mode & 06000, 0u);
