@@ -53,6 +53,18 @@ bool CloseToOthers(int fd) {
   return ::fchown(fd, ThisUser(), ::getegid()) == 0 && ::fchmod(fd, 0600) == 0 && DropAccessLists(fd);
 }
 
+// Gives the item open as fd the owner, group and mode the record leaves it
+// (from its status before anything was done): owner before mode, as a
+// change of owner clears set-id bits.
+Status LayOwnership(int fd, const Dictionary& all, const struct stat& st, const std::string& path) {
+  Result<ItemOwnership> ownership = OwnershipAfter(all, st, path, AttributesAllowedToSet());
+  if (!ownership.ok()) return ownership.error();
+  if (::fchown(fd, ownership->uid, ownership->gid) != 0 || ::fchmod(fd, ownership->mode) != 0) {
+    return Error::FromErrno(path);
+  }
+  return Status::Ok();
+}
+
 void LogRefusal(const std::string& path, const char* why) {
   VTRLogError("Not granting privilege to %@: %@", path, std::string(why));
 }
@@ -96,9 +108,13 @@ std::optional<bool> RestoreInPlace(const VTRFileMetadata& record, const Dictiona
   // must never meet a granted file, and a break that starts after this
   // runs out long after the grant was checked again.
   if (!lease.stillAlone()) return std::nullopt;
+  // What the record leaves out is what the file had before it was closed.
   const Dictionary* extendedAttributes = record.getExtendedAttributes();
-  Result<std::optional<ItemFlags>> last = SetAttributesOfDescriptorExceptFlags(
-      all, item, path, AttributesAllowedToSet(), extendedAttributes != nullptr && !extendedAttributes->empty());
+  Status given = LayOwnership(item, all, st, path);
+  Result<std::optional<ItemFlags>> last =
+      given.ok() ? SetAttributesOfDescriptorExceptFlags(all, item, path, AttributesAllowedToSet(),
+                                                        extendedAttributes != nullptr && !extendedAttributes->empty())
+                 : Result<std::optional<ItemFlags>>(given.error());
   if (!last.ok()) {
     TakeBack(record, item, st);
     LogAttributesNotSet(path, last.error(), all);
@@ -149,8 +165,7 @@ bool RestoreOntoVerifiedCopy(const VTRFileMetadata& record, int dirFd, const std
     return false;
   }
   if (std::optional<bool> inPlace = RestoreInPlace(record, all, item, st, path)) return *inPlace;
-  Result<ItemOwnership> ownership = OwnershipAfter(all, st, path, AttributesAllowedToSet());
-  Result<FreshFile> copy = ownership.ok() ? FreshFile::MakeIn(dirFd, path) : Result<FreshFile>(ownership.error());
+  Result<FreshFile> copy = FreshFile::MakeIn(dirFd, path);
   if (!copy.ok() || !DropAccessLists(copy->fd())) {
     LogAttributesNotSet(path, copy.ok() ? Error::FromErrno(path) : copy.error(), all);
     return false;
@@ -167,10 +182,7 @@ bool RestoreOntoVerifiedCopy(const VTRFileMetadata& record, int dirFd, const std
   // The copy takes what the item would have been given (owner before mode:
   // a change of owner clears set-id bits), then the rest of the record;
   // its extended attributes before the flags that would forbid them.
-  Status given = Status::Ok();
-  if (::fchown(copy->fd(), ownership->uid, ownership->gid) != 0 || ::fchmod(copy->fd(), ownership->mode) != 0) {
-    given = Error::FromErrno(path);
-  }
+  Status given = LayOwnership(copy->fd(), all, st, path);
   Result<std::optional<ItemFlags>> last =
       given.ok() ? SetAttributesOfDescriptorExceptFlags(all, copy->fd(), path, AttributesAllowedToSet(), false)
                  : Result<std::optional<ItemFlags>>(given.error());
