@@ -163,15 +163,20 @@ bool VTRFileMetadata::restoreAttribuesToItemAt(int dirFd, const std::string& nam
   // Only a regular file or a directory is opened: a device's open could
   // reach its driver, a fifo's block. What is decided is decided on the
   // opened item's own status.
+  // The type is asked again of the opened item: a fifo swapped in between
+  // opens (without blocking) but is no item to lay a record on.
   UniqueFd item;
   struct stat st;
   Status set = Status::Ok();
+  auto openable = [](const struct stat& s) { return S_ISREG(s.st_mode) || S_ISDIR(s.st_mode); };
   if (!StatAt(dirFd, name, &st)) {
     set = Error::FromErrno(path);
-  } else if (!S_ISREG(st.st_mode) && !S_ISDIR(st.st_mode)) {
+  } else if (!openable(st)) {
     set = Error(S_ISLNK(st.st_mode) ? ELOOP : EOPNOTSUPP, path);
   } else if (item = OpenAt(dirFd, name, kReadItemFlags); !item || !StatOf(item.get(), &st)) {
     set = Error::FromErrno(path);
+  } else if (!openable(st)) {
+    set = Error(EOPNOTSUPP, path);
   } else if (S_ISREG(st.st_mode) && GrantsPrivilege(*this, st, client)) {
     return RestoreOntoVerifiedCopy(*this, dirFd, name, item.get(), st, path);
   }
@@ -184,6 +189,11 @@ bool VTRFileMetadata::restoreAttribuesToItemAt(int dirFd, const std::string& nam
                : Result<std::optional<ItemFlags>>(set.error());
   if (!last.ok()) {
     LogAttributesNotSet(path, last.error(), all);
+    return false;
+  }
+  // A folder given to another keeps no access list of mobile's.
+  if (S_ISDIR(st.st_mode) && GrantsPrivilege(*this, st, client) && !DropAccessLists(item.get())) {
+    LogAttributesNotSet(path, Error::FromErrno(path), all);
     return false;
   }
   // The protection class has no Linux counterpart: setting it succeeds

@@ -6,6 +6,8 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <cerrno>
+
 #include "model/file_hash.h"
 #include "model/log.h"
 #include "model/restore_steps.h"
@@ -41,6 +43,28 @@ const char* ContentRefusal(const VTRFileMetadata& record, const struct stat& st)
   return nullptr;
 }
 
+// Closes the staged file open as fd to everyone but the helper before its
+// content is judged: owner and group the helper's, mode 0600, no access
+// list. An open for writing that passed its permission check while the file
+// was still mobile's and has not yet taken its write access (which a lease
+// cannot see) must be caught by the lease while the content is hashed, not
+// after the grant.
+bool CloseToOthers(int fd) {
+  return ::fchown(fd, ThisUser(), ::getegid()) == 0 && ::fchmod(fd, 0600) == 0 && DropAccessLists(fd);
+}
+
+// Gives the item open as fd the owner, group and mode the record leaves it
+// (from its status before anything was done): owner before mode, as a
+// change of owner clears set-id bits.
+Status LayOwnership(int fd, const Dictionary& all, const struct stat& st, const std::string& path) {
+  Result<ItemOwnership> ownership = OwnershipAfter(all, st, path, AttributesAllowedToSet());
+  if (!ownership.ok()) return ownership.error();
+  if (::fchown(fd, ownership->uid, ownership->gid) != 0 || ::fchmod(fd, ownership->mode) != 0) {
+    return Error::FromErrno(path);
+  }
+  return Status::Ok();
+}
+
 void LogRefusal(const std::string& path, const char* why) {
   VTRLogError("Not granting privilege to %@: %@", path, std::string(why));
 }
@@ -69,10 +93,14 @@ std::optional<bool> RestoreInPlace(const VTRFileMetadata& record, const Dictiona
   if (st.st_nlink != 1) return std::nullopt;
   WriterLease lease(item);
   if (!lease.held()) return std::nullopt;
+  if (!CloseToOthers(item) || !lease.stillAlone()) {
+    TakeBack(record, item, st);
+    return std::nullopt;
+  }
   const std::optional<Bytes> digest = fileHashOfDescriptor(item, path, PageCache::kKeep);
-  if (!digest) return false;
-  if (*digest != *record.getHash()) {
-    LogRefusal(path, "its content does not hash to the record's");
+  if (!digest || *digest != *record.getHash()) {
+    TakeBack(record, item, st);
+    if (digest) LogRefusal(path, "its content does not hash to the record's");
     return false;
   }
   // Asked before the grant as well as after: a writer that was let in when
@@ -80,9 +108,13 @@ std::optional<bool> RestoreInPlace(const VTRFileMetadata& record, const Dictiona
   // must never meet a granted file, and a break that starts after this
   // runs out long after the grant was checked again.
   if (!lease.stillAlone()) return std::nullopt;
+  // What the record leaves out is what the file had before it was closed.
   const Dictionary* extendedAttributes = record.getExtendedAttributes();
-  Result<std::optional<ItemFlags>> last = SetAttributesOfDescriptorExceptFlags(
-      all, item, path, AttributesAllowedToSet(), extendedAttributes != nullptr && !extendedAttributes->empty());
+  Status given = LayOwnership(item, all, st, path);
+  Result<std::optional<ItemFlags>> last =
+      given.ok() ? SetAttributesOfDescriptorExceptFlags(all, item, path, AttributesAllowedToSet(),
+                                                        extendedAttributes != nullptr && !extendedAttributes->empty())
+                 : Result<std::optional<ItemFlags>>(given.error());
   if (!last.ok()) {
     TakeBack(record, item, st);
     LogAttributesNotSet(path, last.error(), all);
@@ -105,6 +137,15 @@ std::optional<bool> RestoreInPlace(const VTRFileMetadata& record, const Dictiona
 
 }  // namespace
 
+bool DropAccessLists(int fd) {
+  auto drop = [fd](const char* name) {
+    return RemoveExtendedAttributeOf(fd, name) == 0 || errno == ENODATA || errno == EOPNOTSUPP;
+  };
+  struct stat st;
+  return ::fstat(fd, &st) == 0 && drop("system.posix_acl_access") &&
+         (!S_ISDIR(st.st_mode) || drop("system.posix_acl_default"));
+}
+
 bool GrantsPrivilege(const VTRFileMetadata& record, const struct stat& st, const ClientAccount& client) {
   static const Dictionary kNone;
   const Dictionary* attributes = record.getFileAttributes();
@@ -124,10 +165,9 @@ bool RestoreOntoVerifiedCopy(const VTRFileMetadata& record, int dirFd, const std
     return false;
   }
   if (std::optional<bool> inPlace = RestoreInPlace(record, all, item, st, path)) return *inPlace;
-  Result<ItemOwnership> ownership = OwnershipAfter(all, st, path, AttributesAllowedToSet());
-  Result<FreshFile> copy = ownership.ok() ? FreshFile::MakeIn(dirFd, path) : Result<FreshFile>(ownership.error());
-  if (!copy.ok()) {
-    LogAttributesNotSet(path, copy.error(), all);
+  Result<FreshFile> copy = FreshFile::MakeIn(dirFd, path);
+  if (!copy.ok() || !DropAccessLists(copy->fd())) {
+    LogAttributesNotSet(path, copy.ok() ? Error::FromErrno(path) : copy.error(), all);
     return false;
   }
   const std::optional<Bytes> digest = copyHashing(item, static_cast<uint64_t>(st.st_size), copy->fd());
@@ -142,10 +182,7 @@ bool RestoreOntoVerifiedCopy(const VTRFileMetadata& record, int dirFd, const std
   // The copy takes what the item would have been given (owner before mode:
   // a change of owner clears set-id bits), then the rest of the record;
   // its extended attributes before the flags that would forbid them.
-  Status given = Status::Ok();
-  if (::fchown(copy->fd(), ownership->uid, ownership->gid) != 0 || ::fchmod(copy->fd(), ownership->mode) != 0) {
-    given = Error::FromErrno(path);
-  }
+  Status given = LayOwnership(copy->fd(), all, st, path);
   Result<std::optional<ItemFlags>> last =
       given.ok() ? SetAttributesOfDescriptorExceptFlags(all, copy->fd(), path, AttributesAllowedToSet(), false)
                  : Result<std::optional<ItemFlags>>(given.error());

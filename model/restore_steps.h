@@ -35,6 +35,15 @@ void LogAttributesNotSet(const std::string& path, const Error& error, const Dict
 // either way of restoring).
 bool GrantsPrivilege(const VTRFileMetadata& record, const struct stat& st, const ClientAccount& client);
 
+// Drops the access lists of the item open as fd (a folder's default list
+// too): mobile's own on what it staged, or what a copy inherited from the
+// default list of mobile's folder. A named entry outlives any change of
+// owner or mode and, under a record whose group may write, would let mobile
+// write what was given to another (or, by default, what root makes in it
+// later). A list the record holds is laid on again with its extended
+// attributes. False, errno set, when one stays.
+bool DropAccessLists(int fd);
+
 // Lays record, which grants privilege, onto the regular file name of dirFd,
 // open as item (status st): the record's size and SHA-1 must match the
 // content, hashed from the descriptor that is then changed. In place when a

@@ -16,8 +16,11 @@ WriterLease::~WriterLease() {
 }
 
 bool WriterLease::stillAlone() const {
-  // A lease being broken reads as the type it is going to: unlocked.
-  return fd_ >= 0 && ::fcntl(fd_, F_GETLEASE) == F_RDLCK;
+  // A lease being broken reads as the type it is going to: unlocked. A
+  // writer that took its write access but has not come to break the lease
+  // yet is seen by taking the lease again: refused while anyone holds
+  // write access (EAGAIN).
+  return fd_ >= 0 && ::fcntl(fd_, F_GETLEASE) == F_RDLCK && ::fcntl(fd_, F_SETLEASE, F_RDLCK) == 0;
 }
 
 }  // namespace vtr

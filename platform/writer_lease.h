@@ -31,7 +31,8 @@ class WriterLease {
   WriterLease& operator=(const WriterLease&) = delete;
 
   bool held() const { return fd_ >= 0; }
-  // Whether the lease is still held and no writer has come to wait on it.
+  // Whether the lease is still held, no writer has come to wait on it and
+  // no one holds write access to the file.
   bool stillAlone() const;
 
  private:

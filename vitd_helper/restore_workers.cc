@@ -35,20 +35,22 @@ bool RestoreRecord(OpenDirectoryChain& directories, const std::string& root, con
   return record.restoreAttribuesToItemAt(*parent, name, target, client);
 }
 
+bool IsDirectory(const Value& record) {
+  const std::string* type = VTRFileMetadata(record).getFileType();
+  return type != nullptr && *type == kNSFileTypeDirectory;
+}
+
 // The modification date a directory record sets, or null for any other
 // record.
 const Value* DirectoryDate(const Value& record) {
-  const VTRFileMetadata metadata(record);
-  const std::string* type = metadata.getFileType();
-  if (type == nullptr || *type != kNSFileTypeDirectory) return nullptr;
-  return metadata.getFileAttributes()->find(kNSFileModificationDate);
+  return IsDirectory(record) ? VTRFileMetadata(record).getFileAttributes()->find(kNSFileModificationDate) : nullptr;
 }
 
 }  // namespace
 
 RestoreWorkers::RestoreWorkers(int stagingDir, std::string root, ClientAccount client, unsigned workers)
     : stagingDir_(stagingDir), root_(std::move(root)), client_(client) {
-  filling_.reserve(kBatchSize);
+  filling_.records.reserve(kBatchSize);
   for (unsigned i = 0; i < std::max(workers, 1u); ++i) threads_.emplace_back([this] { work(); });
 }
 
@@ -58,16 +60,28 @@ RestoreWorkers::~RestoreWorkers() {
 
 bool RestoreWorkers::add(std::string key, Value record) {
   if (failed_.load(std::memory_order_relaxed)) return false;
-  filling_.emplace_back(std::move(key), std::move(record));
-  if (filling_.size() == kBatchSize) {
+  if (IsDirectory(record)) {
+    if (!filling_.records.empty()) push(std::move(filling_));
+    Batch folder;
+    folder.records.emplace_back(std::move(key), std::move(record));
+    folder.folder = true;
+    push(std::move(folder));
+    filling_ = Batch();
+    filling_.records.reserve(kBatchSize);
+    return !failed_.load(std::memory_order_relaxed);
+  }
+  filling_.records.emplace_back(std::move(key), std::move(record));
+  if (filling_.records.size() == kBatchSize) {
     push(std::move(filling_));
     filling_ = Batch();
-    filling_.reserve(kBatchSize);
+    filling_.records.reserve(kBatchSize);
   }
   return !failed_.load(std::memory_order_relaxed);
 }
 
 void RestoreWorkers::push(Batch batch) {
+  batch.foldersBefore = foldersAdded_;
+  if (batch.folder) ++foldersAdded_;
   std::unique_lock lock(mutex_);
   changed_.wait(lock, [this] { return queue_.size() < kMaxQueuedBatches || failed_; });
   if (failed_) return;
@@ -76,7 +90,7 @@ void RestoreWorkers::push(Batch batch) {
 }
 
 bool RestoreWorkers::finish() {
-  if (!filling_.empty()) push(std::move(filling_));
+  if (!filling_.records.empty()) push(std::move(filling_));
   {
     std::lock_guard lock(mutex_);
     closed_ = true;
@@ -110,13 +124,15 @@ void RestoreWorkers::work() {
     Batch batch;
     {
       std::unique_lock lock(mutex_);
-      changed_.wait(lock, [this] { return !queue_.empty() || closed_ || failed_; });
-      if (failed_ || queue_.empty()) return;
+      // A batch begins only once every folder added before it is laid.
+      auto ready = [this] { return !queue_.empty() && foldersDone_ >= queue_.front().foldersBefore; };
+      changed_.wait(lock, [&] { return ready() || (closed_ && queue_.empty()) || failed_; });
+      if (failed_ || !ready()) return;
       batch = std::move(queue_.front());
       queue_.pop_front();
     }
     changed_.notify_all();
-    for (const auto& [key, record] : batch) {
+    for (const auto& [key, record] : batch.records) {
       if (failed_.load(std::memory_order_relaxed)) return;
       if (!RestoreRecord(directories, root_, client_, key, record)) {
         std::lock_guard lock(mutex_);
@@ -128,6 +144,11 @@ void RestoreWorkers::work() {
         std::lock_guard lock(mutex_);
         directoryDates_.emplace_back(key, *date);
       }
+    }
+    if (batch.folder) {
+      std::lock_guard lock(mutex_);
+      ++foldersDone_;
+      changed_.notify_all();
     }
   }
 }

@@ -15,6 +15,11 @@
 // modification dates of the directories again (the copies put in place
 // beneath them changed them). add() and finish() are called from one
 // thread.
+//
+// A directory's record is laid before any record added after it is begun:
+// once a folder is given to another, mobile can no longer swap what is laid
+// into it (another worker could otherwise restore a file of the folder
+// while it was still mobile's, and mobile put its own in its place).
 #ifndef VTR_VITD_HELPER_RESTORE_WORKERS_H_
 #define VTR_VITD_HELPER_RESTORE_WORKERS_H_
 
@@ -54,7 +59,11 @@ class RestoreWorkers {
   bool finish();
 
  private:
-  using Batch = std::vector<std::pair<std::string, Value>>;
+  struct Batch {
+    std::vector<std::pair<std::string, Value>> records;
+    bool folder = false;        // one directory's record, which later batches wait for
+    size_t foldersBefore = 0;   // folder batches added before this one
+  };
 
   void work();
   void push(Batch batch);
@@ -70,6 +79,8 @@ class RestoreWorkers {
   std::mutex mutex_;
   std::condition_variable changed_;
   std::deque<Batch> queue_;
+  size_t foldersAdded_ = 0;  // by the adding thread
+  size_t foldersDone_ = 0;   // under mutex_
   bool closed_ = false;
   std::atomic<bool> failed_{false};
   std::vector<std::thread> threads_;

@@ -208,6 +208,38 @@ TEST(RestoreAttributesTest, AnImmutableFileTakesItsExtendedAttributesEveryTime) 
   }
 }
 
+// What a privileged record leaves out stays as the staged file had it, in
+// place and on a copy: a set-uid record without an owner keeps mobile's, an
+// owner without a mode keeps the file's mode.
+TEST(RestoreAttributesTest, WhatAPrivilegedRecordLeavesOutStaysTheFiles) {
+  if (!IsRoot()) GTEST_SKIP() << "changing owners needs root";
+  TempDir dir;
+  WriteFile(dir / "f", "content");
+  UniqueFd folder(::open(dir.path().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  const struct {
+    std::vector<Dictionary::Entry> attributes;
+    uid_t owner;
+    mode_t mode;
+  } cases[] = {{{{kNSFilePosixPermissions, Value::Integer(04755)}}, 501, 04755},
+               {{{kNSFileOwnerAccountID, Value::Integer(0)}}, 0, 0604}};
+  for (const auto& c : cases) {
+    for (const bool lease : {true, false}) {
+      ASSERT_EQ(::chown((dir / "f").c_str(), 501, 501), 0);
+      ASSERT_EQ(::chmod((dir / "f").c_str(), 0604), 0);
+      Parts parts;
+      parts.hash = Value::Data(*fileHash(dir / "f"));
+      parts.attributes = c.attributes;
+      const auto restore = [&] {
+        return std::string(parts.record().restoreAttribuesToItemAt(folder.get(), "f", dir / "f", {501, 501}) ? "YES"
+                                                                                                             : "NO");
+      };
+      EXPECT_EQ(lease ? restore() : testing::RunWithFailingSyscalls({SYS_fcntl}, EPERM, restore), "YES");
+      EXPECT_EQ(Lstat(dir / "f").st_uid, c.owner) << lease;
+      EXPECT_EQ(Lstat(dir / "f").st_mode & 07777, c.mode) << lease;
+    }
+  }
+}
+
 // Extended attributes of a link go onto the link, on kernels with
 // setxattrat and on those without.
 TEST(RestoreAttributesTest, ALinkTakesItsExtendedAttributesOnEveryKernel) {

@@ -5,6 +5,9 @@
 
 #include <fcntl.h>
 #include <linux/fs.h>
+#include <poll.h>
+#include <sys/fsuid.h>
+#include <sys/inotify.h>
 #include <sys/ioctl.h>
 #include <sys/mman.h>
 #include <sys/stat.h>
@@ -12,7 +15,9 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <climits>
 #include <cstdlib>
+#include <thread>
 
 #include <gtest/gtest.h>
 
@@ -306,6 +311,13 @@ class RestoreTest : public OperationsTest {
     ASSERT_EQ(::symlink("m", (demo + "/d/ml").c_str()), 0);
     ASSERT_EQ(::lchown((demo + "/d/ml").c_str(), kMobile, kMobile), 0);
     ASSERT_EQ(::utimensat(AT_FDCWD, (demo + "/d").c_str(), old, 0), 0);
+    Sign();
+    LayDown();
+  }
+
+  // Signs the manifest of the demo tree as it stands.
+  void Sign() {
+    const TestPki& pki = TestPki::Get();
     ASSERT_TRUE(ops_.createDeviceManifest("/private/var/mobile/Demo", true));
     Result<Value> manifest = ReadPropertyListFile(host("/private/var/VTRWorkContainer/DeviceManifest.plist"));
     ASSERT_TRUE(manifest.ok());
@@ -319,7 +331,6 @@ class RestoreTest : public OperationsTest {
     });
     const Bytes signedManifest = pki.productionSigned(payload);
     WriteFile(host("/private/var/mobile/m.plist"), std::string(signedManifest.begin(), signedManifest.end()));
-    LayDown();
   }
 
   // The content as the daemon lays it: the recorded bytes (mobile's own
@@ -450,6 +461,12 @@ TEST_F(RestoreTest, PrivilegeGoesOnlyToTheSignedContentOnAnInodeNobodyElseHolds)
   // The signed bytes, with a writable descriptor, a shared writable mapping
   // and a second link that mobile keeps: none reaches the restored file.
   LayDown();
+  // Mobile's access lists too: one on a file granted in place, a default
+  // one on the folder a copy is made in.
+  const std::string acl = {2, 0, 0, 0, 1, 0, 6, 0, -1, -1, -1, -1, 2, 0, 6, 0, -11, 1, 0, 0,
+                           4, 0, 4, 0, -1, -1, -1, -1, 16, 0, 6, 0, -1, -1, -1, -1, 32, 0, 4, 0, -1, -1, -1, -1};
+  ASSERT_EQ(::setxattr((staging + "/d/f").c_str(), "system.posix_acl_access", acl.data(), acl.size(), 0), 0);
+  ASSERT_EQ(::setxattr((staging + "/d").c_str(), "system.posix_acl_default", acl.data(), acl.size(), 0), 0);
   const std::string g = staging + "/d/g";
   const std::string kept = host("/private/var/mobile/kept");
   ASSERT_EQ(::link(g.c_str(), kept.c_str()), 0);
@@ -464,9 +481,42 @@ TEST_F(RestoreTest, PrivilegeGoesOnlyToTheSignedContentOnAnInodeNobodyElseHolds)
   const struct stat restored = Lstat(g);
   EXPECT_EQ(restored.st_mode & 07777, 04755u);
   EXPECT_EQ(restored.st_nlink, 1u);
+  for (const char* file : {"f", "g"}) EXPECT_EQ(Xattr(staging + "/d/" + file, "system.posix_acl_access"), "<none>") << file;
+  EXPECT_EQ(Xattr(staging + "/d", "system.posix_acl_default"), "<none>") << "root's folder";
   EXPECT_EQ(Lstat(staging + "/d").st_mtim.tv_sec, 1000000000) << "once the copy beneath it is in place";
   EXPECT_EQ(Lstat(kept).st_uid, kMobile);
   EXPECT_EQ(Lstat(kept).st_mode & 06000, 0u);
+}
+
+TEST_F(RestoreTest, WhatIsLaidIntoAFolderCannotBeSwappedByMobile) {
+  // A folder whose record closes a batch of records and whose file opens
+  // the next: the file is laid only once its folder is root's, so that
+  // mobile, told by inotify when the file was restored, cannot rename its
+  // own over it.
+  const std::string demo = host("/private/var/mobile/Demo");
+  ASSERT_EQ(::mkdir((demo + "/a").c_str(), 0755), 0);
+  for (int i = 0; i < 61; ++i) WriteFile(demo + "/a/f" + std::to_string(100 + i), std::string(1 << 18, 'a'));
+  ASSERT_EQ(::mkdir((demo + "/b").c_str(), 0755), 0);
+  WriteFile(demo + "/b/x", "x");
+  Sign();
+  const std::string staging = host("/private/var/staging");
+  ASSERT_EQ(std::system(("cp -a '" + demo + "/a' '" + demo + "/b' '" + staging + "/' && echo mine > '" + staging +
+                         "/b/mine' && chown -R 501:501 '" + staging + "'").c_str()), 0);
+  const int watch = ::inotify_init1(IN_CLOEXEC);
+  ASSERT_GE(::inotify_add_watch(watch, (staging + "/b/x").c_str(), IN_ATTRIB), 0);
+  const UniqueFd folder(::open((staging + "/b").c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));  // mobile's place
+  std::thread mobile([&] {
+    char event[sizeof(struct inotify_event) + NAME_MAX + 1];
+    struct pollfd ready = {watch, POLLIN, 0};
+    if (::poll(&ready, 1, 20000) != 1 || ::read(watch, event, sizeof event) <= 0) return;
+    (void)::setfsuid(kMobile);  // this thread only, and without root's file capabilities
+    (void)::renameat(folder.get(), "mine", folder.get(), "x");
+  });
+  EXPECT_TRUE(Restore());
+  ::close(watch);
+  mobile.join();
+  EXPECT_EQ(Lstat(staging + "/b/x").st_uid, 0u);
+  EXPECT_EQ(ReadFile(staging + "/b/x"), "x");
 }
 
 TEST_F(RestoreTest, AManifestFileIsReadWithinItsSizeAndTheLimit) {
