@@ -44,13 +44,22 @@ const char* ContentRefusal(const VTRFileMetadata& record, const struct stat& st)
 }
 
 // Closes the staged file open as fd to everyone but the helper before its
-// content is judged: owner and group the helper's, mode 0600, no access
-// list. An open for writing that passed its permission check while the file
-// was still mobile's and has not yet taken its write access (which a lease
-// cannot see) must be caught by the lease while the content is hashed, not
-// after the grant.
-bool CloseToOthers(int fd) {
-  return ::fchown(fd, ThisUser(), ::getegid()) == 0 && ::fchmod(fd, 0600) == 0 && DropAccessLists(fd);
+// content is judged: owner and group the helper's, no access list, and the
+// record's mode without set-id bits and without write for group or others
+// (nothing is granted yet, and a record that gives the file to root then
+// seldom needs its mode set a second time). An open for writing that passed
+// its permission check while the file was still mobile's and has not yet
+// taken its write access (which a lease cannot see) must be caught by the
+// lease while the content is hashed, not after the grant.
+bool CloseToOthers(int fd, mode_t mode) {
+  return ::fchown(fd, ThisUser(), ::getegid()) == 0 && ::fchmod(fd, mode & 0755) == 0 && DropAccessLists(fd);
+}
+
+// The mode the record leaves the file open as fd (status st before)
+// closed to others: 0600 when the record's cannot be read.
+mode_t ClosedMode(const Dictionary& all, const struct stat& st, const std::string& path) {
+  Result<ItemOwnership> ownership = OwnershipAfter(all, st, path, AttributesAllowedToSet());
+  return ownership.ok() ? ownership->mode & 0755 : 0600;
 }
 
 // Gives the item open as fd the owner, group and mode the record leaves it
@@ -59,7 +68,13 @@ bool CloseToOthers(int fd) {
 Status LayOwnership(int fd, const Dictionary& all, const struct stat& st, const std::string& path) {
   Result<ItemOwnership> ownership = OwnershipAfter(all, st, path, AttributesAllowedToSet());
   if (!ownership.ok()) return ownership.error();
-  if (::fchown(fd, ownership->uid, ownership->gid) != 0 || ::fchmod(fd, ownership->mode) != 0) {
+  // What already holds is not set again: each change of an inode is a
+  // journal entry, and most records give root what closing gave it.
+  struct stat now;
+  if (::fstat(fd, &now) != 0) return Error::FromErrno(path);
+  const bool owned = now.st_uid == ownership->uid && now.st_gid == ownership->gid;
+  if (!owned && ::fchown(fd, ownership->uid, ownership->gid) != 0) return Error::FromErrno(path);
+  if ((!owned || (now.st_mode & 07777) != ownership->mode) && ::fchmod(fd, ownership->mode) != 0) {
     return Error::FromErrno(path);
   }
   return Status::Ok();
@@ -93,7 +108,8 @@ std::optional<bool> RestoreInPlace(const VTRFileMetadata& record, const Dictiona
   if (st.st_nlink != 1) return std::nullopt;
   WriterLease lease(item);
   if (!lease.held()) return std::nullopt;
-  if (!CloseToOthers(item) || !lease.stillAlone()) {
+  // No writer can write while the lease holds: a new one waits on it.
+  if (!CloseToOthers(item, ClosedMode(all, st, path))) {
     TakeBack(record, item, st);
     return std::nullopt;
   }
@@ -107,7 +123,12 @@ std::optional<bool> RestoreInPlace(const VTRFileMetadata& record, const Dictiona
   // the kernel's lease-break time ran out (while a large file was hashed)
   // must never meet a granted file, and a break that starts after this
   // runs out long after the grant was checked again.
-  if (!lease.stillAlone()) return std::nullopt;
+  // A writer that took its write access meanwhile but has not come to
+  // the lease yet will wait on it, and the check after the grant sees it.
+  if (!lease.unbroken()) {
+    TakeBack(record, item, st);
+    return std::nullopt;
+  }
   // What the record leaves out is what the file had before it was closed.
   const Dictionary* extendedAttributes = record.getExtendedAttributes();
   Status given = LayOwnership(item, all, st, path);
@@ -138,7 +159,10 @@ std::optional<bool> RestoreInPlace(const VTRFileMetadata& record, const Dictiona
 }  // namespace
 
 bool DropAccessLists(int fd) {
+  // Asked before it is removed: a removal is a journal entry even where
+  // there is nothing to remove, and most files have no list.
   auto drop = [fd](const char* name) {
+    if (GetExtendedAttributeOf(fd, name, nullptr, 0) < 0 && (errno == ENODATA || errno == EOPNOTSUPP)) return true;
     return RemoveExtendedAttributeOf(fd, name) == 0 || errno == ENODATA || errno == EOPNOTSUPP;
   };
   struct stat st;

@@ -20,7 +20,9 @@ bool WriterLease::stillAlone() const {
   // writer that took its write access but has not come to break the lease
   // yet is seen by taking the lease again: refused while anyone holds
   // write access (EAGAIN).
-  return fd_ >= 0 && ::fcntl(fd_, F_GETLEASE) == F_RDLCK && ::fcntl(fd_, F_SETLEASE, F_RDLCK) == 0;
+  return unbroken() && ::fcntl(fd_, F_SETLEASE, F_RDLCK) == 0;
 }
+
+bool WriterLease::unbroken() const { return fd_ >= 0 && ::fcntl(fd_, F_GETLEASE) == F_RDLCK; }
 
 }  // namespace vtr

@@ -34,6 +34,11 @@ class WriterLease {
   // Whether the lease is still held, no writer has come to wait on it and
   // no one holds write access to the file.
   bool stillAlone() const;
+  // Whether the lease is still held and no writer has come to wait on it
+  // (one that took write access but has not come yet is not seen): enough
+  // before a change that stillAlone() checks again before the release, as
+  // such a writer then waits on the lease.
+  bool unbroken() const;
 
  private:
   int fd_ = -1;
