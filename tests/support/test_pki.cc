@@ -1,5 +1,7 @@
 #include "tests/support/test_pki.h"
 
+#include <unistd.h>
+
 #include <cstdlib>
 
 #include <gtest/gtest.h>
@@ -41,11 +43,23 @@ const TestPki& TestPki::Get() {
   return *pki;
 }
 
+// The folder of the program's one PKI, removed when the program ends, but
+// not by a child it forked that ends through exit().
+class PkiFolder {
+ public:
+  const std::string& path() const { return folder_.path(); }
+  ~PkiFolder() {
+    if (::getpid() != owner_) folder_.keep();
+  }
+
+ private:
+  TempDir folder_;
+  pid_t owner_ = ::getpid();
+};
+
 TestPki::TestPki() {
-  // Lives as long as the program; removed by no one but the system's /tmp
-  // cleaning, as it is made once per program.
-  static TempDir* const folder = new TempDir();
-  folder_ = folder->path();
+  static PkiFolder folder;
+  folder_ = folder.path();
   WriteFile(folder_ + "/make-pki.sh", kMakePki);
   const std::string command = "cd '" + folder_ + "' && sh make-pki.sh";
   EXPECT_EQ(std::system(command.c_str()), 0) << "the openssl tool failed";

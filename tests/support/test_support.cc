@@ -67,7 +67,9 @@ TempDir::TempDir() {
   path_ = pattern;
 }
 
-TempDir::~TempDir() { RemoveTree(path_); }
+TempDir::~TempDir() {
+  if (!path_.empty()) RemoveTree(path_);
+}
 
 void RemoveTree(const std::string& path) {
   // Make everything writable first so that read-only directories go too.

@@ -34,6 +34,8 @@ class TempDir {
   const std::string& path() const { return path_; }
   // path() + "/" + relative
   std::string operator/(const std::string& relative) const { return path_ + "/" + relative; }
+  // Leaves the folder in place when this goes (a forked child's copy).
+  void keep() { path_.clear(); }
 
  private:
   std::string path_;
