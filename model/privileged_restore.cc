@@ -71,7 +71,7 @@ Status LayOwnership(int fd, const Dictionary& all, const struct stat& st, const 
   // What already holds is not set again: each change of an inode is a
   // journal entry, and most records give root what closing gave it.
   struct stat now;
-  if (::fstat(fd, &now) != 0) return Error::FromErrno(path);
+  if (!StatOf(fd, &now)) return Error::FromErrno(path);
   const bool owned = now.st_uid == ownership->uid && now.st_gid == ownership->gid;
   if (!owned && ::fchown(fd, ownership->uid, ownership->gid) != 0) return Error::FromErrno(path);
   if ((!owned || (now.st_mode & 07777) != ownership->mode) && ::fchmod(fd, ownership->mode) != 0) {
@@ -143,7 +143,7 @@ std::optional<bool> RestoreInPlace(const VTRFileMetadata& record, const Dictiona
   }
   (void)SetRecordExtendedAttributesOf(extendedAttributes, item, path);
   struct stat now;
-  if (!lease.stillAlone() || ::fstat(item, &now) != 0 || now.st_nlink != 1) {
+  if (!lease.stillAlone() || !StatOf(item, &now) || now.st_nlink != 1) {
     TakeBack(record, item, st);
     return std::nullopt;
   }
@@ -166,7 +166,7 @@ bool DropAccessLists(int fd) {
     return RemoveExtendedAttributeOf(fd, name) == 0 || errno == ENODATA || errno == EOPNOTSUPP;
   };
   struct stat st;
-  return ::fstat(fd, &st) == 0 && drop("system.posix_acl_access") &&
+  return StatOf(fd, &st) && drop("system.posix_acl_access") &&
          (!S_ISDIR(st.st_mode) || drop("system.posix_acl_default"));
 }
 
